@@ -1,0 +1,88 @@
+// Rule configurations of the port-map library: collecting rules and writing
+// them out (RouterRuleConfWriter), and walking the rules of a stored
+// configuration (RouterRuleConfReader).
+#ifndef ZARK_PLATFORM_ROUTERRULECONF_H
+#define ZARK_PLATFORM_ROUTERRULECONF_H
+
+#include "libzarkportmap.h"
+
+#include <string>
+#include <vector>
+
+// One rule as the rule store keeps it.
+struct RouterRule {
+  std::string ruleId;
+  bool enable = false;
+  std::string routerPort;
+  std::string dsPort;
+  std::string protocol;
+  std::string serviceId;
+  std::string serviceName;
+};
+
+// Collects rules in the order they are added.
+class RouterRuleConfWriter {
+public:
+  RouterRuleConfWriter();
+  ~RouterRuleConfWriter();
+
+  // Adds a rule; the int overload uses the decimal text of ruleId. Every
+  // text must fit a rule record field (at most 1023 bytes): a longer one is
+  // refused with false and nothing is added.
+  bool AddRule(int ruleId, bool enable, const std::string &routerPort,
+               const std::string &dsPort, const std::string &protocol,
+               const std::string &serviceId, const std::string &serviceName);
+  bool AddRule(const std::string &ruleId, bool enable,
+               const std::string &routerPort, const std::string &dsPort,
+               const std::string &protocol, const std::string &serviceId,
+               const std::string &serviceName);
+
+  // Hands out the collected rules as a new array for KLibFreeRulesArr
+  // (*rules is NULL and *count 0 when there is none). False on a null
+  // argument or a failed allocation.
+  bool ToArray(int *count, ZARK_ROUTER_RULE **rules) const;
+
+  // Writes the collected rules as the rule configuration at path,
+  // atomically (temporary file, fsync, rename), mode 0600. False, with the
+  // old file left whole, when anything fails.
+  bool Sync(const std::string &path) const;
+
+  const std::vector<RouterRule> &Rules() const { return mRules; }
+
+private:
+  std::vector<RouterRule> mRules;
+};
+
+// Walks the rules of a stored rule configuration. The configuration is read
+// once, at construction: testRules false reads the saved rule configuration
+// (ZARK_PORTMAP_RULE_CONF), true the test rule configuration
+// (ZARK_PORTMAP_TEST_RULE_CONF). A missing file holds no rule; an unreadable
+// or malformed one makes IsValid() false and holds no rule.
+class RouterRuleConfReader {
+public:
+  explicit RouterRuleConfReader(bool testRules = false);
+  // Reads the configuration at path.
+  explicit RouterRuleConfReader(const std::string &path);
+  ~RouterRuleConfReader();
+
+  bool IsValid() const { return mValid; }
+
+  // Moves to the first rule; false when there is none.
+  bool StartNextRule();
+  // Moves to the next rule; false when the last one was passed.
+  bool NextRule();
+
+  // Fields of the current rule; false when there is no current rule.
+  bool GetRuleInfo(bool &enable, std::string &routerPort, std::string &dsPort,
+                   std::string &protocol, std::string &serviceId) const;
+  bool GetRuleInfo(RouterRule &rule) const;
+
+  const std::vector<RouterRule> &Rules() const { return mRules; }
+
+private:
+  std::vector<RouterRule> mRules;
+  size_t mCurrent = 0;
+  bool mValid = true;
+};
+
+#endif

@@ -1,0 +1,1 @@
+#include "ZARK.Core.PortForwarding.h"
