@@ -9,6 +9,7 @@
 
 #include <json/json.h>
 
+#include <cstddef>
 #include <memory>
 #include <string>
 
@@ -82,6 +83,8 @@ public:
   State GetState() const;
   bool IsAnswered() const { return GetState() != State::None; }
   bool IsSuccess() const { return GetState() == State::Success; }
+  // The current answer: each call reads only its own kind, so after a
+  // SetError GetData is null, and after a SetSuccess the code is 0.
   Json::Value GetData() const;      // data of the last SetSuccess
   int GetErrorCode() const;         // code of the last SetError, else 0
   Json::Value GetErrorData() const; // data of the last SetError
@@ -105,6 +108,10 @@ typedef void (*APIPollingCallback)(APIRequest *request, APIResponse *response,
 //    "error": {"code": int, "errors": <error data>}}
 // where "error" is present only after an error answer. A running task that
 // has not answered yet reads {"finish": false, "success": true, "data": {}}.
+// Each SetSuccess(data) on the task's response sets "success" true and
+// "data", and drops "error"; each SetError(code, errors) sets "success"
+// false and "error", and keeps "data". "finish" turns true when the callback
+// returns.
 //
 // A prefix given to List or Stop matches a task when it equals the task's
 // id, or when the id starts with it and the next character of the id is "."
@@ -122,21 +129,32 @@ public:
   // is kept until Stop(id, true).
   void SetRemoveAttr(bool remove);
 
+  // Most tasks held at once. A task counts from Start until both its record
+  // is dropped and its callback has returned.
+  static constexpr std::size_t kMaxTasks = 1024;
+
   // Starts callback(copy of the request, task response, argument) on a new
-  // thread and answers response with {"task_id": id}. Returns false (and
-  // answers WEBAPI_ERR_TASK_START) when no prefix was set or no thread could
-  // be started. A callback that throws ends its task with an error record
-  // (WEBAPI_ERR_TASK_EXCEPTION).
+  // thread and answers response with {"task_id": id}. Without SetRequest the
+  // callback gets an empty request; it never gets null pointers. Returns
+  // false (and answers WEBAPI_ERR_TASK_START with errors {"reason": text})
+  // when no prefix or no callback was set, kMaxTasks tasks are held already
+  // or no thread could be started; false without an answer when response is
+  // null. A callback that throws ends its task with the error record
+  // {"code": WEBAPI_ERR_TASK_EXCEPTION, "errors": {"reason": what()}}.
   bool Start(APIResponse *response, APIPollingCallback callback,
              void *argument);
 
-  // Copies the task's record. False when no such task exists.
+  // Copies the task's record. False when no such task exists (never started,
+  // or its record was dropped).
   bool Status(const std::string &taskId, Json::Value &record);
 
   // result becomes {group: [task ids...], ...} for every task whose group is
   // one of groups (an array of strings) and whose id matches prefix (see
-  // above; an empty prefix matches every task). Ids are listed in start
-  // order. False when groups is not an array.
+  // above; an empty prefix matches every task). Every requested group is a
+  // member, an empty array when no task matches; a group named twice appears
+  // once. Ids are listed in start order. Tasks whose record was dropped are
+  // not listed. False, with result unchanged, when groups is not an array
+  // or holds a non-string.
   bool List(const std::string &prefix, const Json::Value &groups,
             Json::Value &result);
 
@@ -145,11 +163,18 @@ public:
   // by the framework. False when no such task exists.
   bool Stop(const std::string &taskId, bool remove);
 
-  // Task side: true once Stop was called for the task that owns response.
+  // Task side: true once Stop was called for the task that owns response,
+  // while its callback runs. False for any other response and for null.
   static bool IsStopRequested(const APIResponse *response);
 
   // Waits until every task thread started so far has ended and joins it.
-  // For hosts shutting down and for tests.
+  // For hosts shutting down (before unloading a module whose callbacks may
+  // still run) and for tests. Called from a task callback it waits for no
+  // running task (a task cannot wait for itself, nor two tasks for each
+  // other): it only joins the threads of ended tasks, and logs a warning.
+  // Start, Status, List and Stop also join the threads of ended tasks as
+  // they go, and the registry joins all of them when the process exits or
+  // the library is unloaded; no task thread is ever detached.
   static void JoinAll();
 
 private:
