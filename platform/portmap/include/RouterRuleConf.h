@@ -27,8 +27,9 @@ public:
   ~RouterRuleConfWriter();
 
   // Adds a rule; the int overload uses the decimal text of ruleId. Every
-  // text must fit a rule record field (at most 1023 bytes): a longer one is
-  // refused with false and nothing is added.
+  // text must fit a rule record field (at most 1023 bytes, no NUL byte): a
+  // text that does not is refused with false (logged) and nothing is added.
+  // Any other bytes are kept exactly.
   bool AddRule(int ruleId, bool enable, const std::string &routerPort,
                const std::string &dsPort, const std::string &protocol,
                const std::string &serviceId, const std::string &serviceName);
@@ -43,8 +44,12 @@ public:
   bool ToArray(int *count, ZARK_ROUTER_RULE **rules) const;
 
   // Writes the collected rules as the rule configuration at path,
-  // atomically (temporary file, fsync, rename), mode 0600. False, with the
-  // old file left whole, when anything fails.
+  // atomically (temporary file ".<name>.XXXXXX" in the same folder, fsync,
+  // rename, fsync of the folder), mode 0600; a missing folder is created
+  // with mode 0755. The format is described in platform/portmap/README.md.
+  // False, logged, with the old file left whole and no temporary file left
+  // behind, when anything fails, and when there are more than 65536 rules
+  // (which no reader would take).
   bool Sync(const std::string &path) const;
 
   const std::vector<RouterRule> &Rules() const { return mRules; }
@@ -57,7 +62,11 @@ private:
 // once, at construction: testRules false reads the saved rule configuration
 // (ZARK_PORTMAP_RULE_CONF), true the test rule configuration
 // (ZARK_PORTMAP_TEST_RULE_CONF). A missing file holds no rule; an unreadable
-// or malformed one makes IsValid() false and holds no rule.
+// or malformed one (also an empty one, or one over 16 MiB or 65536 rules)
+// makes IsValid() false, holds no rule and is logged once to syslog.
+//
+// Walking: StartNextRule(), then GetRuleInfo() for the current rule and
+// NextRule() to move on, until NextRule() returns false.
 class RouterRuleConfReader {
 public:
   explicit RouterRuleConfReader(bool testRules = false);
