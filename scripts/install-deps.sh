@@ -9,6 +9,9 @@ packages=(
   googletest libgtest-dev libgmock-dev libbenchmark-dev
   clang-format
   iproute2 util-linux
+  libminiupnpc-dev libnatpmp-dev miniupnpc natpmpc
+  miniupnpd-nftables nftables
+  libcpp-httplib-dev libcrypt-dev
 )
 
 missing=()
