@@ -127,7 +127,7 @@ PortMap MakeDefaults() {
   };
   fake.KLibStopTestUpnpCompatibility = [] { return 0; };
   fake.KLibUploadTestUpnpCompatibilityFailResult = [] { return 0; };
-  fake.ZARKIGetExternalIP = [] { return htonl(0xCB007107u); // 203.0.113.7 };
+  fake.ZARKIGetExternalIP = [] { return htonl(0xCB007107u); }; // 203.0.113.7
   return fake;
 }
 
