@@ -39,10 +39,13 @@ typedef struct {
 // The table of all firewall sections (opaque).
 typedef struct _ZARK_FW_SERVICE_TABLE ZARK_FW_SERVICE_TABLE;
 
-// Builds the table from the system and package service definitions. Returns
-// the number of sections (> 0), 0 when there is none, negative with the
-// core library's error state set on failure. *table is set in every case
-// except a NULL argument and must be freed with ZARKFwServiceFree.
+// Builds the table from the system and package service definitions (file
+// formats: platform/firewall/README.md). Returns the number of sections
+// (> 0), 0 when there is none, negative with the core library's error state
+// set on failure (NULL argument, out of memory). Malformed sections and
+// unreadable files are left out and logged; they never make the call fail.
+// *table is set in every case except a NULL argument (NULL on failure) and
+// must be freed with ZARKFwServiceFree.
 int ZARKFwServiceEnum(ZARK_FW_SERVICE_TABLE **table);
 
 // The section named name, or NULL when the table has none.
@@ -52,13 +55,16 @@ const ZARK_FW_SERVICE *ZARKFWServiceFind(const ZARK_FW_SERVICE_TABLE *table,
 // Frees a table. NULL is accepted.
 void ZARKFwServiceFree(ZARK_FW_SERVICE_TABLE *table);
 
-// Appends the identifiers of the server's system services. Returns 0, or a
-// negative value with the error state set.
+// Appends the identifiers of the server's system services (the names of the
+// "<id>.sc" files of ZARK_FW_SYSTEM_SERVICE_DIR, sorted). Returns 0, or a
+// negative value with the error state set (NULL list; the folder missing or
+// unreadable).
 int KLIBServiceEnum(KLIBSZLIST **list);
 
 // Appends information of kind `kind` about system service `serviceId`: for
 // KLIB_SERVICE_INFO_FW_SECTIONS, its firewall-section names. Returns 0, or a
-// negative value with the error state set (unknown service, unknown kind).
+// negative value with the error state set (unknown service, unknown kind,
+// unreadable service file). The names come in file order, each once.
 int KLIBServicecfgInfoGet(const char *serviceId, int kind, KLIBSZLIST **list);
 
 #ifdef __cplusplus

@@ -1,0 +1,6 @@
+# VPN server (OpenVPN).
+[openvpn]
+title="OpenVPN"
+protocol=udp
+ports=1194
+forwardable=yes

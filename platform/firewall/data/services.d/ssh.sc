@@ -1,0 +1,6 @@
+# Encrypted terminal access.
+[ssh]
+title="SSH"
+protocol=tcp
+ports=22
+forwardable=yes
