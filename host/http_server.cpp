@@ -1,0 +1,286 @@
+#include "http_server.h"
+
+#include "host_log.h"
+
+#include <httplib.h>
+
+#include <optional>
+#include <system_error>
+#include <thread>
+
+namespace zark::host {
+namespace {
+
+constexpr const char *kJsonType = "application/json";
+constexpr const char *kApiPattern = "/webapi/(entry|query|auth)\\.cgi";
+
+Endpoint EndpointOf(const std::string &path) {
+  if (path == "/webapi/query.cgi") {
+    return Endpoint::Query;
+  }
+  if (path == "/webapi/auth.cgi") {
+    return Endpoint::Auth;
+  }
+  return Endpoint::Entry;
+}
+
+std::string_view QueryOf(const std::string &target) {
+  std::size_t mark = target.find('?');
+  if (mark == std::string::npos) {
+    return {};
+  }
+  return std::string_view(target).substr(mark + 1);
+}
+
+void SendJson(httplib::Response &response, int status,
+              const Json::Value &body) {
+  response.status = status;
+  response.set_header("Cache-Control", "no-store");
+  response.set_content(SerializeAnswer(body), kJsonType);
+}
+
+// The strings a WebRequest views, copied out of the library's request.
+struct ReceivedRequest {
+  std::string cookies;
+  std::optional<std::string> token;
+  std::string contentType;
+  std::string body;
+};
+
+WebRequest ToWebRequest(const httplib::Request &request,
+                        ReceivedRequest &received) {
+  WebRequest web;
+  web.endpoint = EndpointOf(request.path);
+  web.query = QueryOf(request.target);
+  web.clientAddress = request.remote_addr;
+  for (const auto &[name, value] : request.headers) {
+    web.headerBytes += name.size() + value.size();
+  }
+  const std::size_t cookieCount = request.get_header_value_count("Cookie");
+  for (std::size_t i = 0; i < cookieCount; ++i) {
+    if (i > 0) {
+      received.cookies += "; ";
+    }
+    received.cookies += request.get_header_value("Cookie", i);
+  }
+  web.cookies = received.cookies;
+  const std::string tokenHeader(kTokenHeader);
+  if (request.has_header(tokenHeader)) {
+    received.token = request.get_header_value(tokenHeader);
+    web.token = *received.token;
+  }
+  return web;
+}
+
+void SendAnswer(httplib::Response &response, const WebAnswer &answer) {
+  for (const auto &[name, value] : answer.headers) {
+    response.set_header(name, value);
+  }
+  SendJson(response, answer.httpStatus, answer.body);
+}
+
+bool IsApiPath(const std::string &path) {
+  return path.rfind("/webapi/", 0) == 0;
+}
+
+// A www folder that can be served: a folder without a "webapi" entry.
+bool UsableWwwFolder(const std::filesystem::path &folder) {
+  if (folder.empty()) {
+    return false;
+  }
+  std::error_code error;
+  if (!std::filesystem::is_directory(folder, error)) {
+    HOST_LOG(LOG_WARNING,
+             "www folder %s is not a folder; serving the built-in page",
+             folder.c_str());
+    return false;
+  }
+  if (std::filesystem::exists(folder / "webapi", error)) {
+    HOST_LOG(LOG_ERR,
+             "www folder %s holds a \"webapi\" entry, which would hide the "
+             "API; serving the built-in page",
+             folder.c_str());
+    return false;
+  }
+  return true;
+}
+
+} // namespace
+
+std::string BuiltInPage() {
+  return "<!DOCTYPE html>\n<html><head><meta charset=\"utf-8\">"
+         "<title>zark-webapid</title></head><body>"
+         "<h1>zark-webapid</h1>"
+         "<p>The web API is running, but the browser front end is not "
+         "installed.</p>"
+         "<p>Install it and start the host with <code>--www "
+         "FOLDER</code>.</p></body></html>\n";
+}
+
+HttpServer::HttpServer(const RequestHandler &handler, HttpOptions options)
+    : mHandler(handler), mOptions(std::move(options)),
+      mServer(std::make_unique<httplib::Server>()) {
+  Route();
+}
+
+HttpServer::~HttpServer() {
+  Stop();
+}
+
+void HttpServer::Route() {
+  httplib::Server &server = *mServer;
+  const std::size_t threads = mOptions.threads == 0 ? 1 : mOptions.threads;
+  // The library owns and deletes the queue that this factory makes.
+  server.new_task_queue = [threads] {
+    return new httplib::ThreadPool(threads);
+  };
+  server.set_read_timeout(mOptions.readTimeout);
+  server.set_write_timeout(mOptions.writeTimeout);
+  server.set_keep_alive_timeout(mOptions.keepAliveTimeout.count());
+  server.set_keep_alive_max_count(mOptions.keepAliveMaxCount);
+  // Bodies beyond the bound are refused (413) and skipped by the library
+  // before any handler sees them.
+  server.set_payload_max_length(mOptions.maxBodyBytes);
+  server.set_default_headers({{"X-Content-Type-Options", "nosniff"},
+                              {"X-Frame-Options", "DENY"},
+                              {"Referrer-Policy", "no-referrer"}});
+
+  server.Get(kApiPattern, [this](const httplib::Request &request,
+                                 httplib::Response &response) {
+    ReceivedRequest received;
+    WebRequest web = ToWebRequest(request, received);
+    SendAnswer(response, mHandler.Handle(web));
+  });
+
+  server.Post(kApiPattern, [this](const httplib::Request &request,
+                                  httplib::Response &response,
+                                  const httplib::ContentReader &reader) {
+    ReceivedRequest received;
+    bool read = reader([&received](const char *data, std::size_t length) {
+      received.body.append(data, length);
+      return true;
+    });
+    if (!read) {
+      // 413 from the library: more than the payload bound. Otherwise the
+      // client sent a broken body or went away.
+      if (response.status == 413) {
+        Json::Value errors(Json::objectValue);
+        errors["limit"] = "body";
+        errors["max"] = static_cast<Json::UInt64>(mOptions.maxBodyBytes);
+        SendJson(response, 413,
+                 ErrorAnswer(ZARK::WEBAPI_ERR_TOO_LARGE, errors));
+      } else {
+        Json::Value errors(Json::objectValue);
+        errors["reason"] = "body";
+        SendJson(response, 400,
+                 ErrorAnswer(ZARK::WEBAPI_ERR_BAD_REQUEST, errors));
+      }
+      return;
+    }
+    WebRequest web = ToWebRequest(request, received);
+    web.isPost = true;
+    web.body = received.body;
+    received.contentType = request.get_header_value("Content-Type");
+    web.contentType = received.contentType;
+    SendAnswer(response, mHandler.Handle(web));
+  });
+
+  // Failures the library answers itself (bounds, unknown paths under
+  // /webapi/) get a JSON body there too.
+  httplib::Server::HandlerWithResponse errorHandler =
+      [](const httplib::Request &request,
+         httplib::Response &response) -> httplib::Server::HandlerResponse {
+    if (!IsApiPath(request.path) || !response.body.empty()) {
+      return httplib::Server::HandlerResponse::Unhandled;
+    }
+    int code = ZARK::WEBAPI_ERR_BAD_REQUEST;
+    if (response.status == 413 || response.status == 414 ||
+        response.status == 431) {
+      code = ZARK::WEBAPI_ERR_TOO_LARGE;
+    } else if (response.status >= 500) {
+      code = ZARK::WEBAPI_ERR_UNKNOWN;
+    }
+    SendJson(response, response.status, ErrorAnswer(code));
+    return httplib::Server::HandlerResponse::Handled;
+  };
+  server.set_error_handler(std::move(errorHandler));
+  server.set_exception_handler([](const httplib::Request &request,
+                                  httplib::Response &response,
+                                  std::exception_ptr exception) {
+    std::string what = "unknown";
+    try {
+      if (exception) {
+        std::rethrow_exception(exception);
+      }
+    } catch (const std::exception &e) {
+      what = e.what();
+    } catch (...) {
+    }
+    HOST_LOG(LOG_ERR, "request for %s failed: %s", request.path.c_str(),
+             what.c_str());
+    SendJson(response, 500, ErrorAnswer(ZARK::WEBAPI_ERR_UNKNOWN));
+  });
+
+  if (UsableWwwFolder(mOptions.wwwFolder)) {
+    if (!server.set_mount_point("/", mOptions.wwwFolder.string())) {
+      HOST_LOG(LOG_ERR, "www folder %s cannot be served",
+               mOptions.wwwFolder.c_str());
+    } else {
+      HOST_LOG(LOG_INFO, "serving the front end from %s",
+               mOptions.wwwFolder.c_str());
+      return;
+    }
+  }
+  auto page = [](const httplib::Request &, httplib::Response &response) {
+    response.set_content(BuiltInPage(), "text/html; charset=utf-8");
+  };
+  server.Get("/", page);
+  server.Get("/index.html", page);
+}
+
+bool HttpServer::Bind() {
+  if (mOptions.port == 0) {
+    mPort = mServer->bind_to_any_port(mOptions.address);
+  } else if (mServer->bind_to_port(mOptions.address, mOptions.port)) {
+    mPort = mOptions.port;
+  } else {
+    mPort = -1;
+  }
+  if (mPort <= 0) {
+    HOST_LOG(LOG_ERR, "cannot listen on %s port %d", mOptions.address.c_str(),
+             mOptions.port);
+    return false;
+  }
+  HOST_LOG(LOG_INFO, "listening on %s port %d", mOptions.address.c_str(),
+           mPort);
+  return true;
+}
+
+bool HttpServer::Serve() {
+  mServing = true;
+  if (mStopRequested) {
+    mServing = false;
+    return true;
+  }
+  bool served = mServer->listen_after_bind();
+  mServing = false;
+  if (mStopRequested) {
+    return true;
+  }
+  if (!served) {
+    HOST_LOG(LOG_ERR, "the server stopped on an error");
+  }
+  return served;
+}
+
+void HttpServer::Stop() {
+  mStopRequested = true;
+  // stop() acts only on a running server: when Serve has begun but the
+  // library is not yet accepting, wait (bounded) until it is.
+  for (int i = 0; i < 400 && mServing && !mServer->is_running(); ++i) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(5));
+  }
+  mServer->stop();
+}
+
+} // namespace zark::host

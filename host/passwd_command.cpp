@@ -1,0 +1,171 @@
+#include "passwd_command.h"
+
+#include "account_file.h"
+#include "host_log.h"
+#include "host_options.h"
+#include "password_hash.h"
+
+#include <string.h>
+#include <termios.h>
+
+#include <istream>
+#include <optional>
+#include <ostream>
+
+namespace zark::host {
+namespace {
+
+// Turns terminal echo off for its lifetime.
+class EchoOff {
+public:
+  explicit EchoOff(int fd) : mFd(fd) {
+    if (tcgetattr(mFd, &mSaved) == 0) {
+      termios quiet = mSaved;
+      quiet.c_lflag &= ~static_cast<tcflag_t>(ECHO);
+      mActive = tcsetattr(mFd, TCSAFLUSH, &quiet) == 0;
+    }
+  }
+  ~EchoOff() {
+    if (mActive) {
+      tcsetattr(mFd, TCSAFLUSH, &mSaved);
+    }
+  }
+  EchoOff(const EchoOff &) = delete;
+  EchoOff &operator=(const EchoOff &) = delete;
+
+private:
+  int mFd;
+  termios mSaved{};
+  bool mActive = false;
+};
+
+// A string wiped when it goes.
+class Secret {
+public:
+  Secret() = default;
+  ~Secret() { Wipe(); }
+  Secret(const Secret &) = delete;
+  Secret &operator=(const Secret &) = delete;
+  std::string &Text() { return mText; }
+  void Wipe() { explicit_bzero(mText.data(), mText.size()); }
+
+private:
+  std::string mText;
+};
+
+bool ReadLine(PasswordInput &input, const char *prompt, Secret &line) {
+  if (input.terminal && input.prompts != nullptr) {
+    *input.prompts << prompt << std::flush;
+  }
+  bool got = false;
+  {
+    std::optional<EchoOff> quiet;
+    if (input.terminal) {
+      quiet.emplace(input.terminalFd);
+    }
+    got = static_cast<bool>(std::getline(input.in, line.Text()));
+  }
+  if (input.terminal && input.prompts != nullptr) {
+    *input.prompts << "\n";
+  }
+  if (got && !line.Text().empty() && line.Text().back() == '\r') {
+    line.Text().pop_back();
+  }
+  return got;
+}
+
+int Usage(std::ostream &err, const std::string &problem) {
+  err << "zark-webapid passwd: " << problem << "\n"
+      << "usage: zark-webapid passwd USER [--accounts FILE] [--group GROUP]\n";
+  return 2;
+}
+
+} // namespace
+
+int RunPasswdCommand(std::span<const std::string> args, PasswordInput input,
+                     std::ostream &err) {
+  std::optional<std::string> user;
+  std::filesystem::path file = DefaultAccountsFile();
+  std::string group(kAdminGroup);
+  for (std::size_t i = 0; i < args.size(); ++i) {
+    std::string name = args[i];
+    std::optional<std::string> value;
+    if (std::size_t equals = name.find('=');
+        name.rfind("--", 0) == 0 && equals != std::string::npos) {
+      value = name.substr(equals + 1);
+      name.resize(equals);
+    }
+    if (name == "--accounts" || name == "--group") {
+      if (!value) {
+        if (i + 1 >= args.size()) {
+          return Usage(err, name + " needs a value");
+        }
+        value = args[++i];
+      }
+      if (name == "--accounts") {
+        file = *value;
+      } else {
+        group = *value;
+      }
+    } else if (name.rfind("-", 0) == 0) {
+      return Usage(err, "unknown option " + name);
+    } else if (!user) {
+      user = name;
+    } else {
+      return Usage(err, "one user at a time");
+    }
+  }
+  if (!user) {
+    return Usage(err, "no user named");
+  }
+  if (!IsValidAccountName(*user)) {
+    return Usage(err, "a user name has 1 to 64 characters of A-Z a-z 0-9 . _ "
+                      "- and does not begin with -");
+  }
+  if (!IsValidAccountName(group)) {
+    return Usage(err, "a group name has 1 to 64 characters of A-Z a-z 0-9 . "
+                      "_ - and does not begin with -");
+  }
+
+  Secret password;
+  if (!ReadLine(input, "Password: ", password)) {
+    err << "zark-webapid passwd: no password given\n";
+    return 1;
+  }
+  if (input.terminal) {
+    Secret again;
+    if (!ReadLine(input, "Password again: ", again) ||
+        again.Text() != password.Text()) {
+      err << "zark-webapid passwd: the passwords differ; nothing changed\n";
+      return 1;
+    }
+  }
+  if (password.Text().empty() || password.Text().size() > kMaxPasswordLength) {
+    err << "zark-webapid passwd: a password has 1 to " << kMaxPasswordLength
+        << " bytes; nothing changed\n";
+    return 1;
+  }
+  std::optional<std::string> hash = HashPassword(password.Text());
+  password.Wipe();
+  if (!hash) {
+    err << "zark-webapid passwd: the password could not be hashed; nothing "
+           "changed\n";
+    return 1;
+  }
+  std::string error;
+  std::string warning;
+  if (!StoreAccount(file, Account{*user, *hash, group}, error, warning)) {
+    err << "zark-webapid passwd: " << error << "; nothing changed\n";
+    HOST_LOG(LOG_ERR, "password of %s not set in %s: %s", user->c_str(),
+             file.c_str(), error.c_str());
+    return 1;
+  }
+  if (!warning.empty()) {
+    err << "zark-webapid passwd: " << warning << "\n";
+  }
+  HOST_LOG(LOG_NOTICE, "password of %s (group %s) set in %s", user->c_str(),
+           group.c_str(), file.c_str());
+  return 0;
+}
+
+} // namespace zark::host

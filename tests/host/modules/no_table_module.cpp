@@ -1,0 +1,4 @@
+// Not a module: a shared object without GetAPITable.
+extern "C" int NotAModule(void) {
+  return 1;
+}
