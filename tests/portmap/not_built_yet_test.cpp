@@ -46,65 +46,15 @@ TEST_P(PortMapNotBuiltYet, FailsAndSaysSo) {
 
 std::vector<Call> Calls() {
   static ZARK_ROUTER_RULE rule{};
-  static ZARK_ROUTER_SAVE_RULE_RESULT saveResult{};
-  static ZARK_ROUTER_DESC desc{};
-  static ZARK_ROUTER_CONF conf{};
   static ZARK_ROUTER_DETECT_RESULT detect{};
   static ZARK_ROUTER_TEST_COMPATIBILITY_RESULT compat{};
   static ZARK_ROUTER_RECORD record{};
-  static ZARK_LIBZARKPORTMAP_TASK task{};
   return {
-      {"KLibSaveRules",
-       [](ZARK_LIBZARKPORTMAP_ERR *) {
-         return KLibSaveRules("192.168.1.1", 1, &rule, false, &saveResult,
-                              nullptr, nullptr);
-       },
-       false},
-      {"KLibGetLibZarkPortMapRunningTask",
-       [](ZARK_LIBZARKPORTMAP_ERR *) {
-         return KLibGetLibZarkPortMapRunningTask(&task);
-       },
-       false},
       {"KLibTestRulesInit",
        [](ZARK_LIBZARKPORTMAP_ERR *) { return KLibTestRulesInit(); }, false},
       {"KLibTestRules",
        [](ZARK_LIBZARKPORTMAP_ERR *err) {
          return KLibTestRules(1, &rule, err, false);
-       },
-       true},
-      {"KLibGetRouterDBList",
-       [](ZARK_LIBZARKPORTMAP_ERR *) {
-         ZARK_ROUTERDB_LIST *list = reinterpret_cast<ZARK_ROUTERDB_LIST *>(1);
-         int rc = KLibGetRouterDBList(&list);
-         return list == nullptr ? rc : 0;
-       },
-       false},
-      {"KLibFreeRouterDBList",
-       [](ZARK_LIBZARKPORTMAP_ERR *) {
-         // Returns nothing: only its log line tells.
-         KLibFreeRouterDBList(nullptr);
-         return -1;
-       },
-       false},
-      {"KLibUpdateRouterDBList",
-       [](ZARK_LIBZARKPORTMAP_ERR *) {
-         int version = 0;
-         return KLibUpdateRouterDBList(&version);
-       },
-       false},
-      {"KLibGetRouterDesc",
-       [](ZARK_LIBZARKPORTMAP_ERR *err) {
-         return KLibGetRouterDesc("192.168.1.1", &desc, err, false);
-       },
-       true},
-      {"KLibGetRouterConf",
-       [](ZARK_LIBZARKPORTMAP_ERR *err) {
-         return KLibGetRouterConf("192.168.1.1", &conf, err, false);
-       },
-       true},
-      {"KLibSetRouterConf",
-       [](ZARK_LIBZARKPORTMAP_ERR *err) {
-         return KLibSetRouterConf("192.168.1.1", &conf, err, false);
        },
        true},
       {"KLibDetectRouter",
@@ -153,8 +103,6 @@ INSTANTIATE_TEST_SUITE_P(Calls, PortMapNotBuiltYet, testing::ValuesIn(Calls()),
 
 TEST(PortMapNotBuiltYetErr, NullErrorRecordIsFine) {
   ClearLogs();
-  ZARK_ROUTER_CONF conf{};
-  EXPECT_EQ(-1, KLibGetRouterConf("192.168.1.1", &conf, nullptr, false));
   EXPECT_EQ(-1, KLibTestRules(0, nullptr, nullptr, false));
   EXPECT_TRUE(HasLog(LOG_ERR, "KLibTestRules: not built yet"));
 }

@@ -22,52 +22,11 @@ int NotBuiltYet(const char *function, ZARK_LIBZARKPORTMAP_ERR *err = nullptr) {
 
 extern "C" {
 
-int KLibSaveRules(const char *, int, ZARK_ROUTER_RULE *, bool,
-                  ZARK_ROUTER_SAVE_RULE_RESULT *, ZARK_SAVE_RULE_PROGRESS_CB,
-                  void *) {
-  return NotBuiltYet(__func__);
-}
-
-int KLibGetLibZarkPortMapRunningTask(ZARK_LIBZARKPORTMAP_TASK *) {
-  return NotBuiltYet(__func__);
-}
-
 int KLibTestRulesInit(void) {
   return NotBuiltYet(__func__);
 }
 
 int KLibTestRules(int, ZARK_ROUTER_RULE *, ZARK_LIBZARKPORTMAP_ERR *err, bool) {
-  return NotBuiltYet(__func__, err);
-}
-
-int KLibGetRouterDBList(ZARK_ROUTERDB_LIST **list) {
-  if (list != nullptr) {
-    *list = nullptr;
-  }
-  return NotBuiltYet(__func__);
-}
-
-// KLibGetRouterDBList hands out no list yet, so there is nothing to free.
-void KLibFreeRouterDBList(ZARK_ROUTERDB_LIST *) {
-  NotBuiltYet(__func__);
-}
-
-int KLibUpdateRouterDBList(int *) {
-  return NotBuiltYet(__func__);
-}
-
-int KLibGetRouterDesc(const char *, ZARK_ROUTER_DESC *,
-                      ZARK_LIBZARKPORTMAP_ERR *err, bool) {
-  return NotBuiltYet(__func__, err);
-}
-
-int KLibGetRouterConf(const char *, ZARK_ROUTER_CONF *,
-                      ZARK_LIBZARKPORTMAP_ERR *err, bool) {
-  return NotBuiltYet(__func__, err);
-}
-
-int KLibSetRouterConf(const char *, const ZARK_ROUTER_CONF *,
-                      ZARK_LIBZARKPORTMAP_ERR *err, bool) {
   return NotBuiltYet(__func__, err);
 }
 

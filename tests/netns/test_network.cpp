@@ -1,0 +1,309 @@
+#include "test_network.h"
+
+#include "child_process.h"
+
+#include <arpa/inet.h>
+#include <fcntl.h>
+#include <netinet/in.h>
+#include <poll.h>
+#include <sched.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <regex>
+#include <sstream>
+#include <tuple>
+
+namespace zark::testnet {
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+std::string Env(const char *name) {
+  const char *value = std::getenv(name);
+  return value != nullptr ? value : "";
+}
+
+// Waits until fd is readable (or writable) or the deadline passes.
+bool WaitFd(int fd, short events, Clock::time_point deadline) {
+  for (;;) {
+    auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+        deadline - Clock::now());
+    if (left.count() <= 0) {
+      return false;
+    }
+    pollfd pfd{fd, events, 0};
+    int ready = ::poll(&pfd, 1, static_cast<int>(left.count()));
+    if (ready > 0) {
+      return true;
+    }
+    if (ready < 0 && errno != EINTR) {
+      return false;
+    }
+  }
+}
+
+// In the child, after fork: system calls only (no allocation), then _exit.
+[[noreturn]] void ProbeInChild(const char *nsPath, Protocol protocol,
+                               const sockaddr_in &target,
+                               Clock::time_point deadline) {
+  int nsFd = ::open(nsPath, O_RDONLY | O_CLOEXEC);
+  if (nsFd < 0 || ::setns(nsFd, CLONE_NEWNET) != 0) {
+    ::_exit(3);
+  }
+  int fd = ::socket(AF_INET,
+                    (protocol == Protocol::kTcp ? SOCK_STREAM : SOCK_DGRAM) |
+                        SOCK_NONBLOCK | SOCK_CLOEXEC,
+                    0);
+  if (fd < 0) {
+    ::_exit(3);
+  }
+  if (::connect(fd, reinterpret_cast<const sockaddr *>(&target),
+                sizeof(target)) != 0) {
+    if (errno != EINPROGRESS) {
+      ::_exit(1);
+    }
+    if (!WaitFd(fd, POLLOUT, deadline)) {
+      ::_exit(1);
+    }
+    int error = 0;
+    socklen_t length = sizeof(error);
+    if (::getsockopt(fd, SOL_SOCKET, SO_ERROR, &error, &length) != 0 ||
+        error != 0) {
+      ::_exit(1);
+    }
+  }
+  static const char kProbe[] = "probe\n";
+  if (::send(fd, kProbe, sizeof(kProbe) - 1, MSG_NOSIGNAL) !=
+      static_cast<ssize_t>(sizeof(kProbe) - 1)) {
+    ::_exit(1);
+  }
+  char reply[64] = {};
+  std::size_t got = 0;
+  // The reply is "echo:probe\n"; a datagram comes whole.
+  while (got < 11) {
+    if (!WaitFd(fd, POLLIN, deadline)) {
+      ::_exit(1);
+    }
+    ssize_t n = ::recv(fd, reply + got, sizeof(reply) - 1 - got, 0);
+    if (n <= 0) {
+      if (n < 0 && (errno == EAGAIN || errno == EINTR)) {
+        continue;
+      }
+      ::_exit(1);
+    }
+    got += static_cast<std::size_t>(n);
+    if (protocol == Protocol::kUdp) {
+      break;
+    }
+  }
+  ::_exit(std::memcmp(reply, "echo:probe\n", 11) == 0 ? 0 : 1);
+}
+
+} // namespace
+
+std::optional<TestNetwork> CurrentNetwork() {
+  TestNetwork network;
+  network.serverNs = Env("ZARK_TESTNET_SERVER_NS");
+  network.routerNs = Env("ZARK_TESTNET_ROUTER_NS");
+  network.outsideNs = Env("ZARK_TESTNET_OUTSIDE_NS");
+  network.wanRouter = Env("ZARK_TESTNET_WAN_ROUTER");
+  network.wanOutside = Env("ZARK_TESTNET_WAN_OUTSIDE");
+  network.lanRouter = Env("ZARK_TESTNET_LAN_ROUTER");
+  network.lanServer = Env("ZARK_TESTNET_LAN_SERVER");
+  network.rootDesc = Env("ZARK_TESTNET_ROOT_DESC");
+  if (network.serverNs.empty() || network.outsideNs.empty() ||
+      network.wanRouter.empty() || network.rootDesc.empty()) {
+    return std::nullopt;
+  }
+  return network;
+}
+
+bool ProbeFromOutside(const TestNetwork &network, Protocol protocol,
+                      const std::string &address, uint16_t port,
+                      std::chrono::milliseconds timeout) {
+  const std::string nsPath = "/run/netns/" + network.outsideNs;
+  sockaddr_in target{};
+  target.sin_family = AF_INET;
+  target.sin_port = htons(port);
+  if (::inet_pton(AF_INET, address.c_str(), &target.sin_addr) != 1) {
+    return false;
+  }
+  const Clock::time_point deadline = Clock::now() + timeout;
+  pid_t pid = ::fork();
+  if (pid < 0) {
+    return false;
+  }
+  if (pid == 0) {
+    ProbeInChild(nsPath.c_str(), protocol, target, deadline);
+  }
+  // The child gives up at the deadline by itself; a second of grace before
+  // it is killed keeps this wait bounded whatever happens.
+  const Clock::time_point hardDeadline = deadline + std::chrono::seconds(1);
+  int status = 0;
+  for (;;) {
+    pid_t done = ::waitpid(pid, &status, WNOHANG);
+    if (done == pid) {
+      break;
+    }
+    if (done < 0 && errno != EINTR) {
+      return false;
+    }
+    if (Clock::now() > hardDeadline) {
+      ::kill(pid, SIGKILL);
+      ::waitpid(pid, &status, 0);
+      return false;
+    }
+    ::usleep(1000);
+  }
+  return WIFEXITED(status) && WEXITSTATUS(status) == 0;
+}
+
+EchoListener::EchoListener(Protocol protocol, uint16_t port)
+    : mProtocol(protocol) {
+  int fd = ::socket(AF_INET,
+                    (protocol == Protocol::kTcp ? SOCK_STREAM : SOCK_DGRAM) |
+                        SOCK_CLOEXEC,
+                    0);
+  if (fd < 0) {
+    return;
+  }
+  int one = 1;
+  ::setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof(one));
+  sockaddr_in address{};
+  address.sin_family = AF_INET;
+  address.sin_port = htons(port);
+  address.sin_addr.s_addr = htonl(INADDR_ANY);
+  if (::bind(fd, reinterpret_cast<sockaddr *>(&address), sizeof(address)) !=
+          0 ||
+      (protocol == Protocol::kTcp && ::listen(fd, 16) != 0) ||
+      ::pipe2(mStopPipe, O_CLOEXEC) != 0) {
+    ::close(fd);
+    return;
+  }
+  mFd = fd;
+  mThread = std::thread([this] { Serve(); });
+}
+
+EchoListener::~EchoListener() {
+  if (mThread.joinable()) {
+    (void)!::write(mStopPipe[1], "x", 1);
+    mThread.join();
+  }
+  for (int fd : {mFd, mStopPipe[0], mStopPipe[1]}) {
+    if (fd >= 0) {
+      ::close(fd);
+    }
+  }
+}
+
+void EchoListener::Serve() {
+  for (;;) {
+    pollfd fds[2] = {{mFd, POLLIN, 0}, {mStopPipe[0], POLLIN, 0}};
+    if (::poll(fds, 2, -1) < 0) {
+      if (errno == EINTR) {
+        continue;
+      }
+      return;
+    }
+    if (fds[1].revents != 0) {
+      return;
+    }
+    if (fds[0].revents == 0) {
+      continue;
+    }
+    char buffer[512];
+    if (mProtocol == Protocol::kUdp) {
+      sockaddr_in from{};
+      socklen_t length = sizeof(from);
+      ssize_t n = ::recvfrom(mFd, buffer, sizeof(buffer), 0,
+                             reinterpret_cast<sockaddr *>(&from), &length);
+      if (n > 0) {
+        std::string reply = "echo:" + std::string(buffer, n);
+        ::sendto(mFd, reply.data(), reply.size(), 0,
+                 reinterpret_cast<sockaddr *>(&from), length);
+        ++mAnswered;
+      }
+      continue;
+    }
+    int client = ::accept4(mFd, nullptr, nullptr, SOCK_CLOEXEC);
+    if (client < 0) {
+      continue;
+    }
+    // One short line per connection; bounded by a 2 s wait.
+    std::string line;
+    const Clock::time_point deadline = Clock::now() + std::chrono::seconds(2);
+    while (line.find('\n') == std::string::npos && line.size() < 256 &&
+           WaitFd(client, POLLIN, deadline)) {
+      ssize_t n = ::recv(client, buffer, sizeof(buffer), 0);
+      if (n <= 0) {
+        break;
+      }
+      line.append(buffer, static_cast<std::size_t>(n));
+    }
+    std::string reply = "echo:" + line;
+    ::send(client, reply.data(), reply.size(), MSG_NOSIGNAL);
+    ++mAnswered;
+    ::close(client);
+  }
+}
+
+bool UpnpMapping::operator<(const UpnpMapping &other) const {
+  return std::tie(protocol, externalPort, internalAddress, internalPort) <
+         std::tie(other.protocol, other.externalPort, other.internalAddress,
+                  other.internalPort);
+}
+
+int RunTool(const std::vector<std::string> &args, std::string &output,
+            std::chrono::milliseconds timeout) {
+  zark::portmap::ChildOptions options;
+  options.timeout = timeout;
+  zark::portmap::ChildResult result =
+      zark::portmap::RunProgram(args.at(0), args, options);
+  output = result.output + result.errors;
+  if (!result.started || !result.exited || result.timedOut) {
+    return -1;
+  }
+  return result.exitStatus;
+}
+
+bool ListUpnpMappings(const TestNetwork &network,
+                      std::vector<UpnpMapping> &mappings,
+                      std::string *rawOutput) {
+  std::string output;
+  int status =
+      RunTool({"/usr/bin/upnpc", "-u", network.rootDesc, "-l"}, output);
+  if (rawOutput != nullptr) {
+    *rawOutput = output;
+  }
+  if (status != 0) {
+    return false;
+  }
+  // " 0 TCP 18080->192.168.77.2:8080  'zark' '' 604800"
+  static const std::regex kLine(
+      R"(^\s*\d+\s+(TCP|UDP)\s+(\d+)->([0-9.]+):(\d+)\s+'([^']*)'\s+'[^']*'\s+(\d+))");
+  mappings.clear();
+  std::istringstream lines(output);
+  std::string line;
+  while (std::getline(lines, line)) {
+    std::smatch match;
+    if (std::regex_search(line, match, kLine)) {
+      UpnpMapping mapping;
+      mapping.protocol = match[1];
+      mapping.externalPort = std::stoi(match[2]);
+      mapping.internalAddress = match[3];
+      mapping.internalPort = std::stoi(match[4]);
+      mapping.description = match[5];
+      mapping.lease = std::stol(match[6]);
+      mappings.push_back(mapping);
+    }
+  }
+  return true;
+}
+
+} // namespace zark::testnet
