@@ -1,6 +1,7 @@
 // RouterList (list, update, get) and RouterConf (get, set) through the
 // module's entry functions, on the real platform library, in the server
 // namespace of a test network whose default gateway is the test router.
+#include "detect_support.h"
 #include "integration_fixture.h"
 
 #include "library_config.h"
@@ -26,16 +27,15 @@ using zark::test::WriteRouterDb;
 const std::string kSourceKey(zark::portmap::config_key::kRouterDbUpdateSource);
 constexpr const char *kPassword = "pa55-w0rd-zark";
 
-// RouterConf set reads the last detection's result first; until detection
-// is built that call fails and so does every set.
-bool DetectionResultAvailable() {
+// RouterConf set reads the last detection's result first: a real
+// detection of the test router runs before each set (detect_support.h).
+void DetectTheTestRouter(const zark::testnet::TestNetwork &network) {
   ZARK_ROUTER_DETECT_RESULT result{};
+  std::string why;
+  ASSERT_EQ(0, zark::integration::DetectInTestNetwork(network, result, why))
+      << why;
+  ASSERT_STREQ("ZarkTest: TestIGD(1)", result.upnp_pfpath);
   zark::test::ClearLogs();
-  bool available =
-      KLibGetRouterDetectResult(&result) >= 0 ||
-      !HasLogContaining("KLibGetRouterDetectResult: not built yet");
-  zark::test::ClearLogs();
-  return available;
 }
 
 void MakeArchive(int syntax, int version, const std::string &archive) {
@@ -169,14 +169,18 @@ TEST_F(IntegrationRouterConf, GetWithoutConfigurationAnswers1501) {
 }
 
 TEST_F(IntegrationRouterConf, SetStoresAUpnpRouterForTheGateway) {
-  if (!DetectionResultAvailable()) {
-    GTEST_SKIP() << "RouterConf set needs KLibGetRouterDetectResult, which "
-                    "is not built yet";
-  }
+  ASSERT_NO_FATAL_FAILURE(DetectTheTestRouter(mNet));
+  // The detected UPnP router's own configuration is stored first and the
+  // tool runs with it; that configuration needs a connection type.
+  std::string why;
+  ASSERT_TRUE(zark::integration::InstallPortForwardTool(
+      ZARK_PORTFORWARD_TOOL_PATH, false, mNet.lanRouter, why))
+      << why;
   Answer answer =
       Invoke(kApiRouterConf, "set", ParseJson(R"({"router_brand": "Generic",
                            "router_model": "UPnP IGD",
                            "router_version": "generic",
+                           "router_protocol": "http",
                            "support_upnp": "yes", "support_natpmp": "no"})"));
   ASSERT_TRUE(answer.success) << answer.errorCode;
   answer = Invoke(kApiRouterConf, "get");
@@ -190,10 +194,7 @@ TEST_F(IntegrationRouterConf, SetStoresAUpnpRouterForTheGateway) {
 }
 
 TEST_F(IntegrationRouterConf, SetKeepsTheRouterPasswordPrivate) {
-  if (!DetectionResultAvailable()) {
-    GTEST_SKIP() << "RouterConf set needs KLibGetRouterDetectResult, which "
-                    "is not built yet";
-  }
+  ASSERT_NO_FATAL_FAILURE(DetectTheTestRouter(mNet));
   Json::Value params = ParseJson(R"({"router_brand": "Acme",
       "router_model": "R1", "router_version": "2.0", "support_upnp": "no",
       "support_natpmp": "no", "router_protocol": "http", "router_port": 8080,

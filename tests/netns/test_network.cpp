@@ -8,10 +8,12 @@
 #include <poll.h>
 #include <sched.h>
 #include <signal.h>
+#include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -251,6 +253,115 @@ void EchoListener::Serve() {
     ++mAnswered;
     ::close(client);
   }
+}
+
+OutsideProcess::OutsideProcess(const TestNetwork &network,
+                               std::vector<std::string> args,
+                               std::chrono::milliseconds stopWait)
+    : mStopWait(stopWait) {
+  if (args.empty()) {
+    return;
+  }
+  // Everything the child needs is made before fork: after it, the child
+  // only makes system calls.
+  const std::string nsPath = "/run/netns/" + network.outsideNs;
+  std::vector<char *> argv;
+  for (std::string &arg : args) {
+    argv.push_back(arg.data());
+  }
+  argv.push_back(nullptr);
+  const pid_t parent = ::getpid();
+  pid_t pid = ::fork();
+  if (pid < 0) {
+    return;
+  }
+  if (pid == 0) {
+    ::prctl(PR_SET_PDEATHSIG, SIGKILL);
+    if (::getppid() != parent) {
+      ::_exit(127);
+    }
+    ::close_range(3, ~0u, 0);
+    int nsFd = ::open(nsPath.c_str(), O_RDONLY | O_CLOEXEC);
+    if (nsFd < 0 || ::setns(nsFd, CLONE_NEWNET) != 0) {
+      ::_exit(126);
+    }
+    ::execv(argv[0], argv.data());
+    ::_exit(127);
+  }
+  mPid = pid;
+}
+
+OutsideProcess::~OutsideProcess() {
+  if (mPid <= 0) {
+    return;
+  }
+  int status = 0;
+  if (::waitpid(mPid, &status, WNOHANG) == mPid) {
+    return;
+  }
+  ::kill(mPid, SIGTERM);
+  const Clock::time_point deadline = Clock::now() + mStopWait;
+  for (;;) {
+    if (::waitpid(mPid, &status, WNOHANG) == mPid) {
+      return;
+    }
+    if (Clock::now() >= deadline) {
+      ::kill(mPid, SIGKILL);
+      ::waitpid(mPid, &status, 0);
+      return;
+    }
+    ::usleep(2000);
+  }
+}
+
+bool OutsideProcess::Running() {
+  if (mPid <= 0) {
+    return false;
+  }
+  int status = 0;
+  pid_t done = ::waitpid(mPid, &status, WNOHANG);
+  if (done == mPid) {
+    mPid = -1;
+    return false;
+  }
+  return done == 0;
+}
+
+bool OutsideProcess::WaitForTcp(const std::string &address, uint16_t port,
+                                std::chrono::milliseconds timeout) {
+  sockaddr_in target{};
+  target.sin_family = AF_INET;
+  target.sin_port = htons(port);
+  if (::inet_pton(AF_INET, address.c_str(), &target.sin_addr) != 1) {
+    return false;
+  }
+  const Clock::time_point deadline = Clock::now() + timeout;
+  while (Clock::now() < deadline) {
+    if (!Running()) {
+      return false;
+    }
+    int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
+    if (fd < 0) {
+      return false;
+    }
+    bool connected = ::connect(fd, reinterpret_cast<const sockaddr *>(&target),
+                               sizeof(target)) == 0;
+    if (!connected && errno == EINPROGRESS &&
+        WaitFd(fd, POLLOUT,
+               std::min(deadline, Clock::now() + std::chrono::seconds(1)))) {
+      int error = 0;
+      socklen_t length = sizeof(error);
+      connected =
+          ::getsockopt(fd, SOL_SOCKET, SO_ERROR, &error, &length) == 0 &&
+          error == 0;
+    }
+    ::close(fd);
+    if (connected) {
+      return true;
+    }
+    ::usleep(10000);
+  }
+  return false;
 }
 
 bool UpnpMapping::operator<(const UpnpMapping &other) const {

@@ -80,6 +80,36 @@ bool ListUpnpMappings(const TestNetwork &network,
                       std::vector<UpnpMapping> &mappings,
                       std::string *rawOutput = nullptr);
 
+// A program running in the outside namespace (the internet side of the
+// router) for as long as the object lives, such as the probe service. It
+// is started in a child process that enters the outside network namespace
+// and executes args (args[0] an absolute path); it inherits no descriptor
+// but standard input, output and error, and is killed when the test
+// process dies. The destructor stops it: SIGTERM, then SIGKILL after
+// stopWait, and reaps it.
+class OutsideProcess {
+public:
+  OutsideProcess(
+      const TestNetwork &network, std::vector<std::string> args,
+      std::chrono::milliseconds stopWait = std::chrono::milliseconds(2000));
+  OutsideProcess(const OutsideProcess &) = delete;
+  OutsideProcess &operator=(const OutsideProcess &) = delete;
+  ~OutsideProcess();
+
+  // False when the process could not be started, or has ended.
+  bool Running();
+  // Waits, at most timeout, until a TCP connection from this (the server)
+  // namespace to address:port succeeds: the program listens and the
+  // router passes it. False when it does not in time or the program ended.
+  bool WaitForTcp(
+      const std::string &address, uint16_t port,
+      std::chrono::milliseconds timeout = std::chrono::milliseconds(5000));
+
+private:
+  int mPid = -1;
+  std::chrono::milliseconds mStopWait;
+};
+
 // Runs a program (absolute path) and returns its exit status (-1 when it
 // could not run or timed out), with its output in output.
 int RunTool(

@@ -19,6 +19,8 @@
 #     ZARK_TESTNET_* describing the network, brings it down again (also when
 #     PROGRAM fails or the script is interrupted) and exits with PROGRAM's
 #     status. "PROGRAM --gtest_list_tests" runs without a network.
+#     ZARK_TESTNET_UPNP_ALLOW, when set, is the router's only "allow"
+#     permission rule (see start_router_daemon).
 #   testnet.sh up NAME / testnet.sh down NAME
 #     the two halves, for a person debugging (state in /run/zark-testnet).
 #
@@ -43,6 +45,10 @@ log() { echo "testnet: $*" >&2; }
 # vanish with it.
 start_router_daemon() {
   local name=$1
+  # ZARK_TESTNET_UPNP_ALLOW replaces the router's permission rule (external
+  # ports, internal network, internal ports), to give it a table of a known
+  # size: "30500-30523 192.168.77.0/24 1-65535" lets it map 24 ports.
+  local allow=${ZARK_TESTNET_UPNP_ALLOW:-"1-65535 $LAN_NET 1-65535"}
   ip netns exec "$name-r" unshare --mount --propagation private \
     bash -c '
       set -e
@@ -70,7 +76,7 @@ serial=00000001
 upnp_table_name=filter
 upnp_nat_table_name=filter
 lease_file=/run/zark-router/leases
-allow 1-65535 '"$LAN_NET"' 1-65535
+allow '"$allow"'
 deny 0-65535 0.0.0.0/0 0-65535
 CONF
       exec '"$MINIUPNPD"' -d -f /run/zark-router/miniupnpd.conf \

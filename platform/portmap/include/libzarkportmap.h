@@ -41,6 +41,8 @@ enum {
   ZARK_PORTMAP_ERR_ROUTER = 5,          // the router refused or did not answer
   ZARK_PORTMAP_ERR_DB_SYNTAX = 6,       // router database syntax version error
   ZARK_PORTMAP_ERR_NOT_IMPLEMENTED = 7, // the operation is not built yet
+  ZARK_PORTMAP_ERR_PROBE_SERVICE = 8,   // no probe service is configured, or
+                                        // it answered no check (port tests)
 };
 
 typedef struct {
@@ -134,6 +136,7 @@ enum {
   ZARK_DETECT_WARN_GATEWAY = 1u << 0,     // the gateway setting looks wrong
   ZARK_DETECT_WARN_HOPS_UNKNOWN = 1u << 1, // the hop count could not be found
   ZARK_DETECT_WARN_HOPS_OVER_ONE = 1u << 2, // more than one private hop
+  ZARK_DETECT_WARN_DOUBLE_NAT = 1u << 3,  // the router's outside address is private
 };
 
 typedef struct {
@@ -179,6 +182,38 @@ typedef struct {
   ZARK_ROUTER_RECORD record;
 } ZARK_ROUTER_TEST_COMPATIBILITY_RESULT;
 
+// Why a UPnP compatibility test failed (ZARK_ROUTER_TEST_COMPATIBILITY_RESULT
+// .error when KLibTestUpnpCompatibility returns non-zero). Besides these:
+// ZARK_PORTMAP_ERR_NOT_CONFIGURED (2) when no router is configured for the
+// gateway or the configured one is not driven by UPnP,
+// ZARK_PORTMAP_ERR_BAD_PARAMETER (3) for bad arguments, and
+// ZARK_PORTMAP_ERR_GENERIC (1) when the test cannot start at all (another
+// one is running, the port-map lock is held elsewhere, a local file cannot
+// be written). The stage that failed is also marked "failed" in
+// ZARK_PORTMAP_UPNP_TEST_PROGRESS.
+enum {
+  ZARK_UPNP_TEST_ERR_INIT = 13,       // no default gateway, the router's UPnP
+                                      // service cannot be opened, or no probe
+                                      // service is configured
+  ZARK_UPNP_TEST_ERR_ADD = 14,        // the first mapping was not added
+  ZARK_UPNP_TEST_ERR_FILL = 15,       // filling the table: the router stopped
+                                      // answering, or lost mappings it had
+                                      // confirmed
+  ZARK_UPNP_TEST_ERR_DELETE = 16,     // a mapping could not be deleted, or
+                                      // the router still holds it
+  ZARK_UPNP_TEST_ERR_STILL_OPEN = 17, // a deleted mapping still answers from
+                                      // outside, or the probe service gave no
+                                      // verdict
+  ZARK_UPNP_TEST_ERR_READD = 18,      // a deleted mapping could not be added
+                                      // again, or not renewed over itself
+  ZARK_UPNP_TEST_ERR_NOT_OPEN = 19,   // the re-added mapping does not answer
+                                      // from outside, or the probe service
+                                      // gave no verdict
+  ZARK_UPNP_TEST_ERR_STOPPED = 20,    // stopped by
+                                      // KLibStopTestUpnpCompatibility, or out
+                                      // of time
+};
+
 typedef void (*ZARK_SAVE_RULE_PROGRESS_CB)(ZARK_ROUTER_SAVE_RULE_RESULT *result,
                                            void *arg);
 typedef void (*ZARK_DETECT_PROGRESS_CB)(ZARK_ROUTER_DETECT_RESULT *result,
@@ -215,7 +250,19 @@ int KLibSaveRules(const char *gatewayIP, int count, ZARK_ROUTER_RULE *rules,
 int KLibGetLibZarkPortMapRunningTask(ZARK_LIBZARKPORTMAP_TASK *task);
 
 // --- Port tests -------------------------------------------------------------
+// Starts a fresh, empty ZARK_PORTMAP_TEST_STATUS. 0, or -1 when it cannot
+// be written.
 int KLibTestRulesInit(void);
+// Checks from outside, through the probe service of the library
+// configuration ("probe_service_address"), every router port of every
+// enabled rule, and writes ZARK_PORTMAP_TEST_STATUS: one line per enabled
+// rule, "<rule id>=" while it is tested, then "<rule id>=<result>"
+// ("reachable", "unreachable", "partly reachable (k of n ports)", or why it
+// could not be tested, such as "no probe service configured"). 0 when the
+// test ran, whatever the results; -1 with err set when it could not:
+// ZARK_PORTMAP_ERR_PROBE_SERVICE (none configured, or it answered no
+// check), ZARK_PORTMAP_ERR_IO (the status file),
+// ZARK_PORTMAP_ERR_BAD_PARAMETER. flag is not used.
 int KLibTestRules(int count, ZARK_ROUTER_RULE *rules,
                   ZARK_LIBZARKPORTMAP_ERR *err, bool flag);
 
@@ -238,12 +285,33 @@ int KLibDetectRouter(ZARK_ROUTER_DETECT_RESULT *result,
 int KLibGetRouterDetectResult(ZARK_ROUTER_DETECT_RESULT *result);
 
 // --- UPnP compatibility test --------------------------------------------------
+// Tests the UPnP router configured for the default gateway: adds a mapping,
+// fills its table up to maxMappings (1..1024), deletes them all, checks
+// from outside that the port closed, adds it again (twice) and checks that
+// it opened; writes ZARK_PORTMAP_UPNP_TEST_PROGRESS as it goes (flag false:
+// not at all) and calls callback (may be NULL) with result->progress
+// 0..100. Removes every mapping it made. 0 when the router passed, with
+// result->record filled (max_mappings: what its table took); non-zero with
+// result->error set (ZARK_UPNP_TEST_ERR_*, 1, 2, 3) when not. While it
+// runs, KLibGetLibZarkPortMapRunningTask answers ZARK_PORTMAP_TASK_UPNP_TEST.
 int KLibTestUpnpCompatibility(int maxMappings,
                               ZARK_ROUTER_TEST_COMPATIBILITY_RESULT *result,
                               ZARK_TEST_COMPATIBILITY_PROGRESS_CB callback,
                               void *arg, bool flag);
+// Stores a passed router's record in the local database of tested routers
+// (/etc/portforward/upnp_tested_routers.json), replacing one of the same
+// brand, model and version. 0, or -1 for a record that is not one (empty
+// brand or model, max_mappings not 1..1024, a field not NUL-terminated) or
+// a file that cannot be written.
 int KLibWriteRecordIntoUpnpDB(const ZARK_ROUTER_RECORD *record);
+// Stops a running compatibility test (in any process) and returns once it
+// has ended and removed its mappings (at most 60 s); with none running,
+// removes what a killed test left. 0, or -1 when that did not happen.
 int KLibStopTestUpnpCompatibility(void);
+// Sends the last test's report, when it failed, to the library
+// configuration's "report_address" (http:// or https://). 0 when it was
+// taken (2xx); -1 when no address is configured, the last test did not
+// fail, or the upload failed.
 int KLibUploadTestUpnpCompatibilityFailResult(void);
 
 #ifdef __cplusplus

@@ -30,6 +30,13 @@ inline constexpr std::string_view kProbeServiceAddress =
 // Where failed UPnP compatibility test results are uploaded: an "http://"
 // URL.
 inline constexpr std::string_view kReportAddress = "report_address";
+// The name router detection looks up to tell whether the configured name
+// servers answer.
+inline constexpr std::string_view kDnsProbeName = "dns_probe_name";
+// The first router port the UPnP compatibility test maps (decimal,
+// 1024..65000); it fills the router's table from there upwards, skipping
+// ports in use. Default 30500.
+inline constexpr std::string_view kUpnpTestFirstPort = "upnp_test_first_port";
 } // namespace config_key
 
 // The value of key in the library configuration, or fallback when the file

@@ -72,6 +72,24 @@ int CurrentRunningTask(const std::string &path) {
   return ZARK_PORTMAP_TASK_NONE;
 }
 
+int IsTaskRunning(int task, const std::string &path) {
+  UniqueFd fd(
+      ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NOCTTY));
+  if (!fd.Valid()) {
+    if (errno == ENOENT) {
+      return 0;
+    }
+    ZARK_PM_LOG_CALL("open", -1, errno, path.c_str());
+    return -1;
+  }
+  flock lock = ByteOf(task, F_WRLCK);
+  if (::fcntl(fd.Get(), F_OFD_GETLK, &lock) != 0) {
+    ZARK_PM_LOG_CALL("fcntl(F_OFD_GETLK)", -1, errno, path.c_str());
+    return -1;
+  }
+  return lock.l_type != F_UNLCK ? 1 : 0;
+}
+
 } // namespace zark::portmap
 
 extern "C" int

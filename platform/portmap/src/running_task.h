@@ -46,6 +46,12 @@ private:
 [[nodiscard]] int
 CurrentRunningTask(const std::string &path = kRunningTaskPath);
 
+// Whether one job (ZARK_PORTMAP_TASK_UPNP_TEST or _APPLY_RULES) is marked
+// running now, whatever else runs: 1 yes, 0 no (also when the file does not
+// exist), -1, logged, when the file exists but cannot be asked.
+[[nodiscard]] int IsTaskRunning(int task,
+                                const std::string &path = kRunningTaskPath);
+
 } // namespace zark::portmap
 
 #endif
