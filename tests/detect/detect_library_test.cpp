@@ -89,9 +89,14 @@ TEST_F(DetectLibrary, FlagFalseKeepsNothing) {
   ASSERT_EQ(0, KLibDetectRouter(&result, nullptr, nullptr, false));
   ClearLogs();
   ZARK_ROUTER_DETECT_RESULT stored{};
-  EXPECT_EQ(-1, KLibGetRouterDetectResult(&stored));
+  stored.enProgress = 42;
+  std::strcpy(stored.upnp_pfpath, "left over");
+  EXPECT_EQ(0, KLibGetRouterDetectResult(&stored));
+  EXPECT_EQ(0, stored.enProgress);
+  EXPECT_STREQ("", stored.upnp_pfpath);
   EXPECT_TRUE(HasLogContaining("KLibGetRouterDetectResult: no router "
-                               "detection has been run yet"));
+                               "detection has been run yet, answering an "
+                               "empty result"));
 }
 
 TEST_F(DetectLibrary, ANewRunReplacesTheKeptResult) {
@@ -119,7 +124,8 @@ TEST_F(DetectLibrary, ASecondDetectionCannotStartWhileOneRuns) {
   EXPECT_TRUE(HasLogContaining("another router detection is running"));
   EXPECT_TRUE(HasLogContaining("KLibDetectRouter: detection could not start"));
   ZARK_ROUTER_DETECT_RESULT stored{};
-  EXPECT_EQ(-1, KLibGetRouterDetectResult(&stored));
+  EXPECT_EQ(0, KLibGetRouterDetectResult(&stored));
+  EXPECT_EQ(0, stored.enProgress); // nothing kept: the empty result
   ::close(fd);
 
   // Released: the next run starts.

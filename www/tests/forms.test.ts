@@ -80,11 +80,24 @@ describe('buildRouterConfInput', () => {
     password: ' secret ',
   };
 
-  it('sends UPnP without page settings or login', () => {
+  it('sends UPnP with the pages protocol and port but without a login', () => {
     expect(buildRouterConfInput({ ...v, mode: 'upnp' })).toEqual({
       ok: true,
-      input: { router_brand: 'Acme', router_model: 'RT-100', router_version: '2.1', support_upnp: 'yes', support_natpmp: 'no' },
+      input: {
+        router_brand: 'Acme',
+        router_model: 'RT-100',
+        router_version: '2.1',
+        support_upnp: 'yes',
+        support_natpmp: 'no',
+        router_protocol: 'https',
+        router_port: 8443,
+      },
     });
+  });
+
+  it('sends UPnP with HTTP on port 80 when the pages fields are empty or wrong', () => {
+    const r = buildRouterConfInput({ ...v, mode: 'upnp', protocol: '', port: 'x' });
+    expect(r.ok && r.input).toMatchObject({ router_protocol: 'http', router_port: 80 });
   });
 
   it('sends NAT-PMP without page settings or login', () => {

@@ -12,6 +12,7 @@
 
 #include <fcntl.h>
 #include <sys/file.h>
+#include <syslog.h>
 
 #include <cerrno>
 #include <cstdio>
@@ -378,9 +379,13 @@ int KLibGetRouterDetectResult(ZARK_ROUTER_DETECT_RESULT *result) {
       *result = loaded;
       return 0;
     case DetectResultLoad::kNone:
-      ZARK_PM_LOG_ERROR("KLibGetRouterDetectResult: no router detection has "
-                        "been run yet");
-      return -1;
+      // Nothing detected yet is an answer, not a failure: an empty record
+      // (no router found), so that a router can be configured by hand
+      // before any detection has run.
+      *result = ZARK_ROUTER_DETECT_RESULT{};
+      syslog(LOG_INFO, "KLibGetRouterDetectResult: no router detection has "
+                       "been run yet, answering an empty result");
+      return 0;
     case DetectResultLoad::kBroken:
       return -1;
     }

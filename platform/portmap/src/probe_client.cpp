@@ -257,12 +257,16 @@ ProbeAnswer ProbeClient::Exchange(const std::string &line) {
   ProbeAnswer answer;
   for (int attempt = 0;; ++attempt) {
     answer = ExchangeOnce(line);
-    if (answer.status != ProbeStatus::kRateLimited ||
+    // "busy": the service holds as many connections from us as it takes;
+    // one of ours ends soon, so try again shortly, like a rate limit.
+    const bool busy =
+        answer.status == ProbeStatus::kRefused && answer.reason == "busy";
+    if ((answer.status != ProbeStatus::kRateLimited && !busy) ||
         attempt >= mOptions.rateLimitRetries) {
       return answer;
     }
     auto wait = std::chrono::milliseconds(
-        answer.retryAfterMs >= 0 ? answer.retryAfterMs : 1000);
+        answer.retryAfterMs >= 0 ? answer.retryAfterMs : (busy ? 250 : 1000));
     wait = std::min(wait, mOptions.maxRetryWait);
     const Clock::time_point until = Clock::now() + wait;
     while (Clock::now() < until) {

@@ -31,8 +31,25 @@ export function buildRouterConfInput(v: RouterConfValues): RouterConfCheck {
     router_model: v.model.trim(),
     router_version: v.version.trim(),
   };
-  if (v.mode === 'upnp') return { ok: true, input: { ...base, support_upnp: 'yes', support_natpmp: 'no' } };
-  if (v.mode === 'natpmp') return { ok: true, input: { ...base, support_upnp: 'no', support_natpmp: 'yes' } };
+  // A router driven by UPnP or NAT-PMP needs no page access of its own, but
+  // storing it after a detection also stores the detected router under its
+  // own name, and that configuration needs a way to its pages: the pages'
+  // protocol and port go along (HTTP on 80 unless the form says otherwise).
+  if (v.mode === 'upnp' || v.mode === 'natpmp') {
+    const protocol = v.protocol.trim() || 'http';
+    const portText = v.port.trim();
+    const port = /^\d{1,5}$/.test(portText) && Number(portText) >= 1 && Number(portText) <= 65535 ? Number(portText) : 80;
+    return {
+      ok: true,
+      input: {
+        ...base,
+        support_upnp: v.mode === 'upnp' ? 'yes' : 'no',
+        support_natpmp: v.mode === 'natpmp' ? 'yes' : 'no',
+        router_protocol: protocol,
+        router_port: port,
+      },
+    };
+  }
 
   if (base.router_brand === '') return { ok: false, field: 'brand', error: 'Choose the router’s brand (from the list of known routers).' };
   if (base.router_model === '') return { ok: false, field: 'model', error: 'Choose the router’s model (from the list of known routers).' };
