@@ -1,5 +1,6 @@
 #include "router_driver.h"
 
+#include "detect_log.h"
 #include "natpmp.h"
 #include "portmap_log.h"
 #include "router_conf_store.h"
@@ -46,6 +47,24 @@ bool ChooseRouter(const std::string &gateway, RouterChoice &choice, int &err) {
     return false;
   }
   std::optional<std::string> protocol = ProtocolOfRouterConf(conf);
+  if (!protocol) {
+    if (std::optional<InferredProtocol> inferred =
+            InferProtocolOfRouter(conf)) {
+      ZARK_DETECT_INFO(
+          "the router configured for gateway %s (%.*s %.*s %.*s) has no "
+          "protocol flag set; driving it by %s, as %s says",
+          gateway.c_str(), static_cast<int>(Field(conf.brand).size()),
+          Field(conf.brand).data(), static_cast<int>(Field(conf.model).size()),
+          Field(conf.model).data(),
+          static_cast<int>(Field(conf.version).size()),
+          Field(conf.version).data(),
+          inferred->protocol == kProtocolUpnp ? "UPnP" : "NAT-PMP",
+          inferred->source == ProtocolSource::kRouterDb
+              ? "its router database entry"
+              : "the kept detection record");
+      protocol = inferred->protocol;
+    }
+  }
   if (!protocol) {
     ZARK_PM_LOG_ERROR(
         "the router configured for gateway %s (%.*s %.*s) is driven through "

@@ -3,15 +3,25 @@
 //
 //   support_upnp "yes"                -> UPnP IGD (upnp.h)
 //   otherwise support_natpmp "yes"    -> NAT-PMP (natpmp.h)
+//   otherwise, by the router it names:
+//     its router database entry (brand, model, version; else the model's
+//     generic entry) when that says upnp or natpmp,
+//     else the kept detection record when it found the same router
+//     (support_upnp 1 -> UPnP, else support_natpmp 1 -> NAT-PMP)
 //   otherwise (the router's own web pages) -> refused with
 //     ZARK_PORTMAP_ERR_NOT_CONFIGURED: no driver for router pages exists yet
 //   no configuration stored           -> ZARK_PORTMAP_ERR_NOT_CONFIGURED
+//
+// A configuration without "yes" flags is what the module stores for a router
+// that detection found by UPnP ("pfpath" configuration) before it runs the
+// zarkportforward tool, so the tool must still find the router's protocol.
 #ifndef ZARK_PORTMAP_ROUTER_DRIVER_H
 #define ZARK_PORTMAP_ROUTER_DRIVER_H
 
 #include "libzarkportmap.h"
 #include "local_network.h"
 #include "mapping_state.h"
+#include "protocol_inference.h"
 #include "router_protocol.h"
 
 #include <chrono>
