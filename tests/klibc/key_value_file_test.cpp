@@ -401,11 +401,11 @@ TEST_F(KlibcKeyValueFile, SetRefusesToGrowAFilePastTheSizeLimit) {
 }
 
 TEST_F(KlibcKeyValueFile, EnumSectionAppendsNamesInFileOrder) {
-  WriteFile(kFile, "top=1\n[web]\na=1\n[ ssh ]\n[dsm]\n# [hidden]\n[web]\n");
+  WriteFile(kFile, "top=1\n[web]\na=1\n[ ssh ]\n[admin]\n# [hidden]\n[web]\n");
   SzListPtr list = MakeList();
   ASSERT_EQ(KLIBCSzListPush(ListSlot(list), "existing"), 0);
   EXPECT_EQ(KLIBCFileEnumSection(kFile, ListSlot(list)), 3);
-  EXPECT_EQ(Items(list.get()), (Strings{"existing", "web", "ssh", "dsm"}));
+  EXPECT_EQ(Items(list.get()), (Strings{"existing", "web", "ssh", "admin"}));
   ExpectNoError();
 }
 
