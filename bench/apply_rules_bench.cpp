@@ -66,6 +66,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <charconv>
 #include <chrono>
 #include <cstdio>
 #include <cstring>
@@ -74,9 +75,9 @@
 #include <map>
 #include <memory>
 #include <optional>
-#include <regex>
 #include <set>
 #include <string>
+#include <string_view>
 #include <tuple>
 #include <vector>
 
@@ -243,11 +244,22 @@ bool ReadRouterCounts(RouterCounts &counts, std::string &why) {
   //   counter upnp_http {
   //           packets 401 bytes 24060
   //   }
-  static const std::regex kCounter(R"(counter (\w+) \{\s*packets (\d+))");
   std::map<std::string, long long> found;
-  for (auto it = std::sregex_iterator(output.begin(), output.end(), kCounter);
-       it != std::sregex_iterator(); ++it) {
-    found[(*it)[1]] = std::stoll((*it)[2]);
+  for (const char *name : {"upnp_http", "ssdp"}) {
+    const std::size_t counter =
+        output.find("counter " + std::string(name) + " {");
+    const std::size_t packets = output.find("packets ", counter);
+    if (counter == std::string::npos || packets == std::string::npos) {
+      break;
+    }
+    const char *digits = output.data() + packets + 8;
+    long long value = 0;
+    auto [end, error] =
+        std::from_chars(digits, output.data() + output.size(), value);
+    if (error != std::errc() || end == digits) {
+      break;
+    }
+    found[name] = value;
   }
   if (found.size() != 2) {
     why = "cannot read the router's counters: " + output;
@@ -977,14 +989,22 @@ void PrintSummary() {
 bool ParseRootDescription(const std::string &url, std::string &host,
                           uint16_t &port) {
   // "http://192.168.77.1:5000/rootDesc.xml"
-  static const std::regex kUrl(R"(^http://([0-9.]+):(\d+)/)");
-  std::smatch match;
-  if (!std::regex_search(url, match, kUrl)) {
+  constexpr std::string_view kScheme = "http://";
+  std::string_view rest(url);
+  if (!rest.starts_with(kScheme)) {
     return false;
   }
-  host = match[1];
-  port = static_cast<uint16_t>(std::stoi(match[2]));
-  return true;
+  rest.remove_prefix(kScheme.size());
+  const std::size_t colon = rest.find(':');
+  const std::size_t slash = rest.find('/');
+  if (colon == std::string_view::npos || slash == std::string_view::npos ||
+      slash < colon) {
+    return false;
+  }
+  host = std::string(rest.substr(0, colon));
+  auto [end, error] =
+      std::from_chars(rest.data() + colon + 1, rest.data() + slash, port);
+  return error == std::errc() && end == rest.data() + slash && port != 0;
 }
 
 } // namespace
