@@ -3,7 +3,11 @@
 #include "host_log.h"
 
 #include <httplib.h>
+#include <sys/socket.h>
 
+#include <cerrno>
+#include <cstring>
+#include <memory>
 #include <optional>
 #include <system_error>
 #include <thread>
@@ -206,7 +210,7 @@ void HttpServer::Route() {
   server.set_error_handler(std::move(errorHandler));
   server.set_exception_handler([](const httplib::Request &request,
                                   httplib::Response &response,
-                                  std::exception_ptr exception) {
+                                  const std::exception_ptr &exception) {
     std::string what = "unknown";
     try {
       if (exception) {
@@ -239,6 +243,17 @@ void HttpServer::Route() {
 }
 
 bool HttpServer::Bind() {
+  // The HTTP library listens with a backlog of 5 (CPPHTTPLIB_LISTEN_BACKLOG,
+  // fixed when the distribution built it): a burst of clients connecting at
+  // once overflows it, and the kernel drops their handshakes (a second's
+  // wait to retry) or resets them. Listening again on the bound socket with
+  // the system's maximum raises the backlog; the socket is the one the
+  // library's socket options were last applied to.
+  auto listening = std::make_shared<int>(-1);
+  mServer->set_socket_options([listening](socket_t sock) {
+    httplib::default_socket_options(sock);
+    *listening = sock;
+  });
   if (mOptions.port == 0) {
     mPort = mServer->bind_to_any_port(mOptions.address);
   } else if (mServer->bind_to_port(mOptions.address, mOptions.port)) {
@@ -250,6 +265,10 @@ bool HttpServer::Bind() {
     HOST_LOG(LOG_ERR, "cannot listen on %s port %d", mOptions.address.c_str(),
              mOptions.port);
     return false;
+  }
+  if (::listen(*listening, SOMAXCONN) != 0) {
+    HOST_LOG(LOG_WARNING, "listen backlog stays at the HTTP library's: %s",
+             std::strerror(errno));
   }
   HOST_LOG(LOG_INFO, "listening on %s port %d", mOptions.address.c_str(),
            mPort);

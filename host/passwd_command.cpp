@@ -107,7 +107,7 @@ int RunPasswdCommand(std::span<const std::string> args, PasswordInput input,
       } else {
         group = *value;
       }
-    } else if (name.rfind("-", 0) == 0) {
+    } else if (name.rfind('-', 0) == 0) {
       return Usage(err, "unknown option " + name);
     } else if (!user) {
       user = name;

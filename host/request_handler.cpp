@@ -113,7 +113,7 @@ std::string_view FindCookie(std::string_view cookies, std::string_view name) {
 
 RequestHandler::RequestHandler(const ModuleRegistry &modules,
                                SessionStore &sessions, LoginService &logins,
-                               RequestLimits limits, bool secureCookie)
+                               const RequestLimits &limits, bool secureCookie)
     : mModules(modules), mSessions(sessions), mLogins(logins), mLimits(limits),
       mSecureCookie(secureCookie) {}
 

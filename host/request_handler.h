@@ -63,7 +63,8 @@ struct RequestLimits {
 class RequestHandler {
 public:
   RequestHandler(const ModuleRegistry &modules, SessionStore &sessions,
-                 LoginService &logins, RequestLimits limits, bool secureCookie);
+                 LoginService &logins, const RequestLimits &limits,
+                 bool secureCookie);
 
   // Every answer has HTTP status 200 and a JSON body of the wire protocol,
   // except requests beyond the bounds: 431 (headers) and 413 (body), with

@@ -5,6 +5,9 @@
 #
 #   install-deps.sh          building, the main job and the demo
 #   install-deps.sh --e2e    also the browser of the end-to-end tests
+#   install-deps.sh --hardening
+#                            also clang with its sanitizer and libFuzzer
+#                            runtimes, clang-tidy and cppcheck
 #
 # The browser front end needs Node.js >= 20.19 with npm. Debian 12's own
 # nodejs is 18, too old for the locked build tools: where node is missing it
@@ -31,8 +34,9 @@ packages=(
 for arg in "$@"; do
   case "$arg" in
   --e2e) packages+=(chromium) ;;
+  --hardening) packages+=(clang libclang-rt-14-dev clang-tidy cppcheck) ;;
   *)
-    echo "usage: $0 [--e2e]" >&2
+    echo "usage: $0 [--e2e] [--hardening]" >&2
     exit 2
     ;;
   esac

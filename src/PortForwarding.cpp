@@ -9,6 +9,7 @@
 #include <sys/stat.h>
 #include <syslog.h>
 
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -377,7 +378,11 @@ bool PortForwarding::GetPortfwdApplyStatus(std::string &stage,
   if (stage == "add") {
     fraction += 0.5;
   }
-  if (fraction > 1.0) {
+  // Counts the library never writes (negative, or done above total) still
+  // give a percentage of 0 to 100; the conversion to int stays defined.
+  if (fraction < 0.0) {
+    fraction = 0.0;
+  } else if (fraction > 1.0) {
     fraction = 1.0;
   }
   percentage = static_cast<int>(fraction * 100);
@@ -411,14 +416,19 @@ bool PortForwarding::StartPortForwardingStatus(Json::Value &out,
       FileHasData(PF_APPLY_PROGRESS_FILE)) {
     std::string stage;
     int applyPercentage = 0;
-    if (!GetPortfwdApplyStatus(stage, applyPercentage)) {
+    errno = 0;
+    if (GetPortfwdApplyStatus(stage, applyPercentage)) {
+      out["stage"] = stage;
+      status = "processing";
+      percentage = applyPercentage;
+    } else if (ENOENT != errno) {
       syslog(LOG_ERR, "%s:%d get pf apply status failed", __FILE__, __LINE__);
       mStatusReportor->ReportError();
       return false;
     }
-    out["stage"] = stage;
-    status = "processing";
-    percentage = applyPercentage;
+    // ENOENT: the save ended and the library removed the file between the
+    // check above and the open; the poll answers as if it had not been
+    // there, not as a failed save.
   }
 
   out["status"] = status;

@@ -184,6 +184,9 @@ int RouterRuleServHandler::FillPortMapByPorts(const std::string &tcpPorts,
 }
 
 // Exactly "tcp" selects the TCP map; every other text the UDP map.
+// The signature (proto by value) is the class's published one.
+// cppcheck-suppress passedByValue
+// NOLINTNEXTLINE(performance-unnecessary-value-param)
 int RouterRuleServHandler::CheckPort(std::string proto, int port) {
   const std::bitset<65536> &portMap =
       ("tcp" == proto) ? mTCPPortMap : mUDPPortMap;
@@ -216,6 +219,9 @@ void RouterRuleServHandler::FilterOutPorts(const std::string &proto, int first,
   }
 }
 
+// The signature (proto by value) is the class's published one.
+// cppcheck-suppress passedByValue
+// NOLINTNEXTLINE(performance-unnecessary-value-param)
 int RouterRuleServHandler::RemoveConflictPort(std::string proto,
                                               KLIBSZLIST *ports,
                                               std::string &out) {

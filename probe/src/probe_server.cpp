@@ -303,7 +303,7 @@ bool ProbeServer::WriteAll(int fd, std::string_view text) {
 }
 
 void ProbeServer::Serve(UniqueFd fd, sockaddr_storage peer,
-                        socklen_t peerLength, std::string key) {
+                        socklen_t peerLength, const std::string &key) {
   std::string pending;
   for (int served = 0;; ++served) {
     // One line, waiting at most idleTimeout for it.

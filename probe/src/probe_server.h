@@ -94,7 +94,7 @@ private:
   void AcceptLoop();
   void Accept(int listenFd);
   void Serve(UniqueFd fd, sockaddr_storage peer, socklen_t peerLength,
-             std::string key);
+             const std::string &key);
   void ReapSessions(bool all);
   [[nodiscard]] bool WriteAll(int fd, std::string_view text);
   void Log(const std::string &line) const;

@@ -83,9 +83,10 @@ int Apply(const std::string &gateway, bool renew, std::ostream &out,
   if (rc == 0) {
     return kToolOk;
   }
+  // Below ZARK_SAVE_ERR_TOO_MANY_RULES (not configured among them), the
+  // detail is a text too.
   const bool textual = result.errType == ZARK_SAVE_ERR_BAD_PORT_TEXT ||
                        result.errType == ZARK_SAVE_ERR_BAD_PROTOCOL ||
-                       result.errType == ZARK_SAVE_ERR_NOT_CONFIGURED ||
                        result.errType < ZARK_SAVE_ERR_TOO_MANY_RULES;
   err << "zarkportforward: failed (error type " << result.errType << ")";
   if (textual && result.detail.text[0] != '\0') {

@@ -153,5 +153,7 @@ ZARKFWServiceFind(const ZARK_FW_SERVICE_TABLE *table, const char *name) {
 }
 
 extern "C" void ZARKFwServiceFree(ZARK_FW_SERVICE_TABLE *table) {
+  // Deletes the table when it goes out of scope.
+  // cppcheck-suppress unreadVariable
   std::unique_ptr<_ZARK_FW_SERVICE_TABLE> owned(table);
 }

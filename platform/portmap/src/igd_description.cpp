@@ -33,7 +33,8 @@ void AppendDecoded(std::string_view text, std::string &out) {
     }
     text.remove_prefix(amp);
     const std::size_t semicolon = text.find(';');
-    if (semicolon == std::string_view::npos || semicolon > 10) {
+    // No ';' at all (npos) is as far away as a too long name.
+    if (semicolon > 10) {
       out += '&';
       text.remove_prefix(1);
       continue;

@@ -96,7 +96,6 @@ struct NatPmpRouter::Session {
                         natpmpresp_t &response) {
     RouterResult result;
     std::chrono::milliseconds wait = options.firstWait;
-    int lastRc = NATPMP_TRYAGAIN;
     for (int attempt = 1; attempt <= options.tries; ++attempt) {
       int sent = send(&handle);
       if (sent < 0) {
@@ -146,7 +145,6 @@ struct NatPmpRouter::Session {
         if (rc == NATPMP_TRYAGAIN || rc == NATPMP_ERR_WRONGPACKETSOURCE) {
           continue;
         }
-        lastRc = rc;
         int savedErrno = rc == NATPMP_ERR_RECVFROM ? errno : 0;
         std::string tried = detail + " (try " + std::to_string(attempt) +
                             " of " + std::to_string(options.tries) + ")";
@@ -170,12 +168,13 @@ struct NatPmpRouter::Session {
       }
       wait *= 2;
     }
+    // Every wait ran out: the last word of libnatpmp was "try again".
     std::string tried =
         detail + " (" + std::to_string(options.tries) + " tries)";
-    LogRouterCall(__FILE__, __LINE__, call, lastRc, true,
-                  NatPmpResultMeaning(lastRc), tried);
+    LogRouterCall(__FILE__, __LINE__, call, NATPMP_TRYAGAIN, true,
+                  NatPmpResultMeaning(NATPMP_TRYAGAIN), tried);
     result.outcome = RouterOutcome::kNoAnswer;
-    result.code = lastRc;
+    result.code = NATPMP_TRYAGAIN;
     result.message = std::string(call) + " " + detail +
                      ": no reply from the router after " +
                      std::to_string(options.tries) + " tries";

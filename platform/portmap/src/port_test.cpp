@@ -260,6 +260,7 @@ int RunPortTest(std::span<const ZARK_ROUTER_RULE> rules,
   }
   counts.rules = static_cast<int>(plans.size());
   std::vector<std::string> ids;
+  ids.reserve(plans.size());
   for (const RuleChecks &plan : plans) {
     ids.push_back(plan.ruleId);
   }
@@ -330,6 +331,7 @@ int RunPortTest(std::span<const ZARK_ROUTER_RULE> rules,
     }
   }
   std::vector<LocalPortGroup> groups;
+  groups.reserve(byLocalPort.size());
   for (auto &[key, group] : byLocalPort) {
     groups.push_back(std::move(group));
   }

@@ -28,7 +28,7 @@ std::string FolderOf(const std::string &path) {
 
 } // namespace
 
-RunningTaskMark::RunningTaskMark(int task, std::string path) {
+RunningTaskMark::RunningTaskMark(int task, const std::string &path) {
   if (!MakeFolders(FolderOf(path), 0755)) {
     return;
   }

@@ -29,7 +29,8 @@ public:
   // task: ZARK_PORTMAP_TASK_UPNP_TEST or ZARK_PORTMAP_TASK_APPLY_RULES.
   // When the mark cannot be set (file not writable, the same job already
   // marked elsewhere) it is logged and Held() is false; the job goes on.
-  explicit RunningTaskMark(int task, std::string path = kRunningTaskPath);
+  explicit RunningTaskMark(int task,
+                           const std::string &path = kRunningTaskPath);
   RunningTaskMark(const RunningTaskMark &) = delete;
   RunningTaskMark &operator=(const RunningTaskMark &) = delete;
   ~RunningTaskMark() = default; // closing the descriptor drops the lock

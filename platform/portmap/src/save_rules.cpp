@@ -390,8 +390,8 @@ void Applier::RunAdditions(RouterProtocol &router) {
       // Not found, not understood, or not askable (NAT-PMP): add it again;
       // until the router answers, it is not known to be there.
       if (add) {
-        if (RecordedMapping *entry = Record().Find(key.first, key.second)) {
-          entry->held = false;
+        if (RecordedMapping *recorded = Record().Find(key.first, key.second)) {
+          recorded->held = false;
         }
       }
     }
@@ -649,6 +649,8 @@ int ApplyRules(const std::string &gateway,
                ZARK_ROUTER_SAVE_RULE_RESULT &result,
                ZARK_SAVE_RULE_PROGRESS_CB callback, void *arg,
                ApplySummary *summary) {
+  // Where the summary goes when the caller does not want it.
+  // cppcheck-suppress unassignedVariable
   ApplySummary local;
   Applier applier(gateway, options, environment, result, callback, arg);
   return applier.Run(rules, summary != nullptr ? *summary : local);

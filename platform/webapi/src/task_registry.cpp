@@ -177,6 +177,9 @@ std::string TaskRegistry::Start(const TaskSpec &spec) {
   return task->id;
 }
 
+// The task thread keeps its own reference to the task for as long as it
+// runs: task is taken by value on purpose.
+// NOLINTNEXTLINE(performance-unnecessary-value-param)
 void TaskRegistry::Run(TaskRegistry *registry, std::shared_ptr<Task> task,
                        APIPollingCallback callback, void *argument) noexcept {
   tOnTaskThread = true;
@@ -343,6 +346,8 @@ void TaskRegistry::JoinAll() {
         // Threads that JoinEnded took out have ended but may not be joined
         // yet; wait for those batches, then look again for new tasks.
         mJoinsDone.wait(lock, [this] { return mJoinsInFlight == 0; });
+        // The wait let go of the lock: tasks may have started meanwhile.
+        // cppcheck-suppress knownConditionTrueFalse
         if (mThreads.empty()) {
           return;
         }
