@@ -119,6 +119,9 @@ std::optional<TestNetwork> CurrentNetwork() {
   network.lanRouter = Env("ZARK_TESTNET_LAN_ROUTER");
   network.lanServer = Env("ZARK_TESTNET_LAN_SERVER");
   network.rootDesc = Env("ZARK_TESTNET_ROOT_DESC");
+  network.name = Env("ZARK_TESTNET_NAME");
+  network.stateDir = Env("ZARK_TESTNET_STATE");
+  network.script = Env("ZARK_TESTNET_SCRIPT");
   if (network.serverNs.empty() || network.outsideNs.empty() ||
       network.wanRouter.empty() || network.rootDesc.empty()) {
     return std::nullopt;
@@ -415,6 +418,111 @@ bool ListUpnpMappings(const TestNetwork &network,
     }
   }
   return true;
+}
+
+namespace {
+
+bool Failed(std::string *why, const std::string &text) {
+  if (why != nullptr) {
+    *why = text;
+  }
+  return false;
+}
+
+// Runs one of testnet.sh's router commands for this network.
+bool RunRouterCommand(const TestNetwork &network,
+                      const std::vector<std::string> &args, std::string *why) {
+  if (network.script.empty() || network.name.empty()) {
+    return Failed(why, "the network was not started by a testnet.sh that "
+                       "has router commands (ZARK_TESTNET_SCRIPT unset)");
+  }
+  std::vector<std::string> command = {"/bin/bash", network.script};
+  command.insert(command.end(), args.begin(), args.end());
+  std::string output;
+  int status = RunTool(command, output, std::chrono::seconds(15));
+  if (status != 0) {
+    return Failed(why, args.at(0) + " exited with " + std::to_string(status) +
+                           ": " + output);
+  }
+  return true;
+}
+
+bool RunIp(const TestNetwork &network, const std::vector<std::string> &args,
+           std::string *why) {
+  std::vector<std::string> command = {"/usr/sbin/ip", "-n", network.routerNs};
+  command.insert(command.end(), args.begin(), args.end());
+  std::string output;
+  int status = RunTool(command, output);
+  if (status != 0) {
+    std::string text;
+    for (const std::string &arg : command) {
+      text += arg + " ";
+    }
+    return Failed(why, text + "exited with " + std::to_string(status) + ": " +
+                           output);
+  }
+  return true;
+}
+
+} // namespace
+
+bool StopRouterDaemon(const TestNetwork &network, bool kill, std::string *why) {
+  std::vector<std::string> args = {"router-stop", network.name};
+  if (kill) {
+    args.push_back("--kill");
+  }
+  return RunRouterCommand(network, args, why);
+}
+
+bool FlushRouterMappings(const TestNetwork &network, std::string *why) {
+  return RunRouterCommand(network, {"router-flush", network.name}, why);
+}
+
+bool StartRouterDaemon(const TestNetwork &network, bool keepLeases,
+                       std::string *why) {
+  std::vector<std::string> args = {"router-start", network.name};
+  if (keepLeases) {
+    args.push_back("--keep-leases");
+  }
+  return RunRouterCommand(network, args, why);
+}
+
+bool PauseRouterDaemon(const TestNetwork &network, bool pause,
+                       std::string *why) {
+  if (network.stateDir.empty()) {
+    return Failed(why, "the network's state folder is unknown "
+                       "(ZARK_TESTNET_STATE unset)");
+  }
+  const std::string pidFile = network.stateDir + "/router.pid";
+  int fd = ::open(pidFile.c_str(), O_RDONLY | O_CLOEXEC);
+  if (fd < 0) {
+    return Failed(why, "no router daemon: cannot open " + pidFile);
+  }
+  char text[32] = {};
+  ssize_t got = ::read(fd, text, sizeof(text) - 1);
+  ::close(fd);
+  long pid = got > 0 ? std::strtol(text, nullptr, 10) : 0;
+  if (pid <= 1) {
+    return Failed(why, "no router daemon pid in " + pidFile);
+  }
+  if (::kill(static_cast<pid_t>(pid), pause ? SIGSTOP : SIGCONT) != 0) {
+    return Failed(why,
+                  "kill " + std::to_string(pid) + ": " + std::strerror(errno));
+  }
+  return true;
+}
+
+bool CutRouterLan(const TestNetwork &network, std::string *why) {
+  return RunIp(network, {"link", "set", "lan0", "down"}, why);
+}
+
+bool RestoreRouterLan(const TestNetwork &network, std::string *why) {
+  // Taking the link down removed the routes through it: the LAN's own
+  // comes back with the link, the multicast route testnet.sh added must be
+  // put back.
+  return RunIp(network, {"link", "set", "lan0", "up"}, why) &&
+         RunIp(network, {"route", "replace", "239.0.0.0/8", "dev", "lan0"},
+               why);
 }
 
 } // namespace zark::testnet

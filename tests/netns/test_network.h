@@ -24,6 +24,12 @@ struct TestNetwork {
   std::string lanRouter;  // the gateway
   std::string lanServer;  // this process's address
   std::string rootDesc;   // the router's UPnP root description URL
+  // How to reach testnet.sh's router commands (empty when the network was
+  // started by an older testnet.sh): the network's name, its state folder
+  // and the script's absolute path.
+  std::string name;
+  std::string stateDir;
+  std::string script;
 };
 
 // The network testnet.sh described in the environment, or nothing when the
@@ -115,6 +121,42 @@ private:
 int RunTool(
     const std::vector<std::string> &args, std::string &output,
     std::chrono::milliseconds timeout = std::chrono::milliseconds(10000));
+
+// Breaking the router on purpose (fault tests). Each waits for what it
+// started, bounded, and returns false with why set when it failed.
+
+// Stops the router daemon (miniupnpd): kill false sends SIGTERM (a clean
+// shutdown), true SIGKILL (a crash); either way the kernel keeps the
+// forwarding rules it made, and its lease file is kept for
+// StartRouterDaemon. Waits at most 3 s for it to end.
+[[nodiscard]] bool StopRouterDaemon(const TestNetwork &network, bool kill,
+                                    std::string *why = nullptr);
+
+// Empties the router's nftables chains of the daemon: with the daemon
+// stopped, what a router that reboots loses.
+[[nodiscard]] bool FlushRouterMappings(const TestNetwork &network,
+                                       std::string *why = nullptr);
+
+// Starts the router daemon again after StopRouterDaemon and waits until it
+// listens (at most 5 s). keepLeases: with the lease file the stopped
+// daemon left (a restart); otherwise with none (a fresh start).
+[[nodiscard]] bool StartRouterDaemon(const TestNetwork &network,
+                                     bool keepLeases,
+                                     std::string *why = nullptr);
+
+// Freezes (SIGSTOP) or thaws (SIGCONT) the router daemon: while frozen,
+// connections to it are accepted by the kernel and then left unanswered,
+// which holds a job at its next router request.
+[[nodiscard]] bool PauseRouterDaemon(const TestNetwork &network, bool pause,
+                                     std::string *why = nullptr);
+
+// Takes the router's LAN link down (this namespace's link to the router
+// loses its carrier; nothing passes either way) and brings it back up,
+// with the route of the router's SSDP answers that going down removed.
+[[nodiscard]] bool CutRouterLan(const TestNetwork &network,
+                                std::string *why = nullptr);
+[[nodiscard]] bool RestoreRouterLan(const TestNetwork &network,
+                                    std::string *why = nullptr);
 
 } // namespace zark::testnet
 

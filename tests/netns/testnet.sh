@@ -23,6 +23,22 @@
 #     permission rule (see start_router_daemon).
 #   testnet.sh up NAME / testnet.sh down NAME
 #     the two halves, for a person debugging (state in /run/zark-testnet).
+#   testnet.sh router-stop NAME [--kill]
+#     stops the router daemon of network NAME: SIGTERM (a daemon that shuts
+#     down), or SIGKILL with --kill (a crash), and waits for it, at most
+#     3 s. Its lease file is copied to the state folder first, as a router
+#     keeps it on its own storage. The kernel keeps the forwarding rules the
+#     daemon made (miniupnpd leaves them in place either way).
+#   testnet.sh router-flush NAME
+#     empties the nftables chains the daemon fills: the mappings a router
+#     loses when it reboots.
+#   testnet.sh router-start NAME [--keep-leases]
+#     starts the router daemon again (after router-stop) and waits until it
+#     listens; with --keep-leases it starts with the lease file router-stop
+#     kept, otherwise with none.
+#     The router-* commands are for tests that break the router on purpose
+#     (tests/faults); ZARK_TESTNET_NAME, ZARK_TESTNET_STATE and
+#     ZARK_TESTNET_SCRIPT tell a program started by "run" how to call them.
 #
 # Needs root. Bringing the network up takes about 0.2 s, down about 0.1 s.
 set -euo pipefail
@@ -45,6 +61,8 @@ log() { echo "testnet: $*" >&2; }
 # vanish with it.
 start_router_daemon() {
   local name=$1
+  # A lease file to start with (router-start --keep-leases), or none.
+  local leases=${2:-}
   # ZARK_TESTNET_UPNP_ALLOW replaces the router's permission rule (external
   # ports, internal network, internal ports), to give it a table of a known
   # size: "30500-30523 192.168.77.0/24 1-65535" lets it map 24 ports.
@@ -55,6 +73,9 @@ start_router_daemon() {
       mount --bind /dev/null /dev/console
       mkdir -p /run/zark-router
       mount -t tmpfs -o mode=0700 zark-router /run/zark-router
+      if [ -n "'"$leases"'" ]; then
+        cp "'"$leases"'" /run/zark-router/leases
+      fi
       cat > /run/zark-router/miniupnpd.conf <<CONF
 ext_ifname=wan0
 listening_ip=lan0
@@ -81,7 +102,7 @@ deny 0-65535 0.0.0.0/0 0-65535
 CONF
       exec '"$MINIUPNPD"' -d -f /run/zark-router/miniupnpd.conf \
         -P /run/zark-router/miniupnpd.pid
-    ' >"$state/router.log" 2>&1 &
+    ' >>"$state/router.log" 2>&1 &
   echo $! >"$state/router.pid"
 }
 
@@ -176,7 +197,7 @@ down() {
   if [ -f "$state/router.pid" ]; then
     local pid
     pid=$(cat "$state/router.pid")
-    # SIGTERM lets miniupnpd remove its rules; bounded wait, then SIGKILL.
+    # SIGTERM ends miniupnpd (this version leaves its nftables rules behind; the namespace goes with them); bounded wait, then SIGKILL.
     if kill "$pid" 2>/dev/null; then
       for ((i = 0; i < 300; i++)); do
         kill -0 "$pid" 2>/dev/null || break
@@ -193,6 +214,64 @@ down() {
   rmdir /run/zark-testnet 2>/dev/null || true
 }
 
+# True when process PID has ended (gone, or a zombie nobody reaped yet).
+process_ended() {
+  local pid=$1 stat
+  stat=$(cat "/proc/$pid/stat" 2>/dev/null) || return 0
+  # "pid (comm) state ...": the state follows the last ")".
+  stat=${stat##*) }
+  [ "${stat%% *}" = Z ]
+}
+
+router_stop() {
+  local name=$1 signal=$2 pid i
+  if [ ! -f "$state/router.pid" ]; then
+    log "router-stop $name: no router daemon runs"
+    return 1
+  fi
+  pid=$(cat "$state/router.pid")
+  if process_ended "$pid"; then
+    log "router-stop $name: the router daemon ($pid) has ended already"
+    rm -f "$state/router.pid"
+    return 1
+  fi
+  # The lease file lives in the daemon's own mount namespace.
+  if ! cp "/proc/$pid/root/run/zark-router/leases" "$state/leases.saved" \
+    2>/dev/null; then
+    : >"$state/leases.saved"
+  fi
+  kill "-$signal" "$pid"
+  for ((i = 0; i < 300; i++)); do
+    if process_ended "$pid"; then
+      rm -f "$state/router.pid"
+      return 0
+    fi
+    sleep 0.01
+  done
+  log "router-stop $name: the router daemon ($pid) did not end within 3 s"
+  return 1
+}
+
+router_flush() {
+  local name=$1 chain
+  for chain in miniupnpd prerouting_miniupnpd postrouting_miniupnpd; do
+    ip netns exec "$name-r" nft flush chain inet filter "$chain"
+  done
+}
+
+router_start() {
+  local name=$1 keep=$2 leases=""
+  if [ -f "$state/router.pid" ] && ! process_ended "$(cat "$state/router.pid")"; then
+    log "router-start $name: the router daemon runs already"
+    return 1
+  fi
+  if [ "$keep" = 1 ] && [ -s "$state/leases.saved" ]; then
+    leases="$state/leases.saved"
+  fi
+  start_router_daemon "$name" "$leases"
+  wait_for_router "$name"
+}
+
 export_network() {
   local name=$1
   export ZARK_TESTNET_SERVER_NS="$name-s"
@@ -203,6 +282,10 @@ export_network() {
   export ZARK_TESTNET_LAN_ROUTER="$LAN_ROUTER"
   export ZARK_TESTNET_LAN_SERVER="$LAN_SERVER"
   export ZARK_TESTNET_ROOT_DESC="http://$LAN_ROUTER:$HTTP_PORT/rootDesc.xml"
+  export ZARK_TESTNET_NAME="$name"
+  export ZARK_TESTNET_STATE="$state"
+  ZARK_TESTNET_SCRIPT="$(cd "$(dirname "${BASH_SOURCE[0]}")" && pwd)/$(basename "${BASH_SOURCE[0]}")"
+  export ZARK_TESTNET_SCRIPT
 }
 
 command=${1:-}
@@ -237,8 +320,33 @@ down)
   state="/run/zark-testnet/$name"
   down "$name"
   ;;
+router-stop)
+  name=$1
+  state="/run/zark-testnet/$name"
+  signal=TERM
+  if [ "${2:-}" = --kill ]; then
+    signal=KILL
+  fi
+  router_stop "$name" "$signal"
+  ;;
+router-flush)
+  name=$1
+  state="/run/zark-testnet/$name"
+  router_flush "$name"
+  ;;
+router-start)
+  name=$1
+  state="/run/zark-testnet/$name"
+  keep=0
+  if [ "${2:-}" = --keep-leases ]; then
+    keep=1
+  fi
+  router_start "$name" "$keep"
+  ;;
 *)
   echo "usage: $0 run PROGRAM [ARGS...] | up NAME | down NAME" >&2
+  echo "       $0 router-stop NAME [--kill] | router-flush NAME" >&2
+  echo "       $0 router-start NAME [--keep-leases]" >&2
   exit 2
   ;;
 esac
