@@ -197,7 +197,8 @@ down() {
   if [ -f "$state/router.pid" ]; then
     local pid
     pid=$(cat "$state/router.pid")
-    # SIGTERM ends miniupnpd (this version leaves its nftables rules behind; the namespace goes with them); bounded wait, then SIGKILL.
+    # SIGTERM ends miniupnpd (this version leaves its nftables rules
+    # behind; they go with the namespace); bounded wait, then SIGKILL.
     if kill "$pid" 2>/dev/null; then
       for ((i = 0; i < 300; i++)); do
         kill -0 "$pid" 2>/dev/null || break
