@@ -7,9 +7,11 @@
 #include <syslog.h>
 
 #include <atomic>
+#include <chrono>
 #include <regex>
 #include <stdexcept>
 #include <string>
+#include <thread>
 #include <vector>
 
 namespace {
@@ -146,10 +148,37 @@ TEST_F(WebAPIPolling, CallbackWithoutRequestGetsAnEmptyOne) {
 
 // Records
 
+// Copied after the bounded wait for a first answer that never comes.
 TEST_F(WebAPIPolling, RecordOfARunningTaskThatHasNotAnswered) {
   const std::string id = StartWaitingTask();
   ASSERT_FALSE(id.empty());
   EXPECT_EQ(Record(id), RunningRecord());
+}
+
+// A poll that comes before the task's thread has answered (here: held back
+// by a gate that another thread opens a moment later) waits for the first
+// answer instead of copying the empty record.
+TEST_F(WebAPIPolling, StatusWaitsForTheFirstAnswerOfATaskThatHasNotAnswered) {
+  Gate start;
+  Json::Value progress(Json::objectValue);
+  progress["status"] = "processing";
+  progress["percentage"] = 1;
+  const std::string id = StartTask([&](APIRequest *, APIResponse *response) {
+    start.Wait();
+    response->SetSuccess(progress);
+    mRelease.Wait();
+  });
+  ASSERT_FALSE(id.empty());
+  std::thread opener([&] {
+    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    start.Open();
+  });
+  const Json::Value record = Record(id);
+  opener.join();
+  Json::Value expected = RunningRecord();
+  expected["data"] = progress;
+  EXPECT_EQ(record, expected);
+  mRelease.Open();
 }
 
 TEST_F(WebAPIPolling, RecordFollowsSuccessWhileRunningAndAfterFinish) {

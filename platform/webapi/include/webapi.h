@@ -145,7 +145,9 @@ public:
              void *argument);
 
   // Copies the task's record. False when no such task exists (never started,
-  // or its record was dropped).
+  // or its record was dropped). While the task's callback has not answered
+  // yet (its thread may not have run), waits up to two seconds for its first
+  // answer, so that a poll right after Start sees what the task reported.
   bool Status(const std::string &taskId, Json::Value &record);
 
   // result becomes {group: [task ids...], ...} for every task whose group is

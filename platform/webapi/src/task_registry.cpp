@@ -40,6 +40,8 @@ struct TaskRegistry::Task {
   bool listed = false;
   bool stopRequested = false;
   bool ended = false;
+  // True once the callback has answered for the first time, or returned.
+  bool reported = false;
 };
 
 // Keeps a task's record in step with the answers its callback sets on the
@@ -207,10 +209,14 @@ void TaskRegistry::Run(TaskRegistry *registry, std::shared_ptr<Task> task,
 }
 
 void TaskRegistry::RecordSuccess(Task &task, const Json::Value &data) {
-  std::lock_guard lock(mMutex);
-  task.record["success"] = true;
-  task.record["data"] = data;
-  task.record.removeMember("error");
+  {
+    std::lock_guard lock(mMutex);
+    task.record["success"] = true;
+    task.record["data"] = data;
+    task.record.removeMember("error");
+    task.reported = true;
+  }
+  mFirstReport.notify_all();
 }
 
 void TaskRegistry::RecordError(Task &task, int code,
@@ -218,13 +224,18 @@ void TaskRegistry::RecordError(Task &task, int code,
   Json::Value error(Json::objectValue);
   error["code"] = code;
   error["errors"] = errors;
-  std::lock_guard lock(mMutex);
-  task.record["success"] = false;
-  task.record["error"] = std::move(error);
+  {
+    std::lock_guard lock(mMutex);
+    task.record["success"] = false;
+    task.record["error"] = std::move(error);
+    task.reported = true;
+  }
+  mFirstReport.notify_all();
 }
 
 void TaskRegistry::Finish(Task &task) {
   std::lock_guard lock(mMutex);
+  task.reported = true;
   try {
     task.record["finish"] = true;
   } catch (const std::exception &e) {
@@ -235,16 +246,31 @@ void TaskRegistry::Finish(Task &task) {
     UnlistLocked(task);
   }
   mRunning.erase(task.response.get());
+  mFirstReport.notify_all();
   // Last: from here on the thread touches nothing of the registry, so
   // JoinEnded may join it.
   task.ended = true;
 }
 
 bool TaskRegistry::Status(const std::string &taskId, Json::Value &record) {
-  std::lock_guard lock(mMutex);
+  std::unique_lock lock(mMutex);
   const Task *task = FindListedLocked(taskId);
   if (task == nullptr) {
     return false;
+  }
+  if (!task->reported) {
+    // A task whose thread has not run yet has an empty record, which no
+    // status reader can tell from a broken one: a poll right after the
+    // start waits (bounded) for the callback's first answer instead.
+    const std::uint64_t seq = task->seq;
+    mFirstReport.wait_for(lock, kFirstReportWait, [&] {
+      const auto listed = mListed.find(seq);
+      return listed == mListed.end() || listed->second->reported;
+    });
+    task = FindListedLocked(taskId);
+    if (task == nullptr) {
+      return false;
+    }
   }
   record = task->record;
   return true;

@@ -7,6 +7,7 @@
 
 #include "webapi.h"
 
+#include <chrono>
 #include <condition_variable>
 #include <cstddef>
 #include <cstdint>
@@ -25,6 +26,10 @@ namespace ZARK::webapi_internal {
 // Most tasks the registry holds at once: a task counts from Start until its
 // record is dropped and its callback has returned. Start fails beyond it.
 inline constexpr std::size_t kMaxLiveTasks = APIPolling::kMaxTasks;
+
+// How long Status waits for a task's first answer when its callback has not
+// answered yet (a poll that comes before the task's thread has run).
+inline constexpr std::chrono::milliseconds kFirstReportWait{2000};
 
 // True when prefix selects the task id: equal to it, or a leading part of it
 // that ends where the id has "." or "#". An empty prefix selects every id.
@@ -100,6 +105,8 @@ private:
 
   mutable std::mutex mMutex;
   std::condition_variable mJoinsDone;
+  // Notified when a task answers or returns (Status waits for the first).
+  std::condition_variable mFirstReport;
   std::mt19937_64 mRandom;
   std::uint64_t mNextSeq = 0;
   // Records that Status and List see, in start order (key: start sequence).
