@@ -1,59 +1,64 @@
 #!/usr/bin/env bash
 # Builds everything and runs every test: once in a plain build, once under
-# AddressSanitizer and UndefinedBehaviorSanitizer; then the browser front
-# end's build and unit tests, the Debian package's contents, and the
-# end-to-end browser test against the installed host in the test network
-# with a real router. Installs what is missing first. Needs root (private
-# mount and network namespaces).
+# AddressSanitizer, LeakSanitizer and UndefinedBehaviorSanitizer; the host
+# framework and the host under ThreadSanitizer; a bounded libFuzzer run of
+# every fuzz target; clang-tidy and cppcheck; then the browser front end's
+# build and unit tests, the Debian package's contents, and the end-to-end
+# browser test against the installed host in the test network with a real
+# router. Installs what is missing first. Needs root (private mount and
+# network namespaces).
 #
-# ZARK_E2E=0 leaves the end-to-end test out; its steps are chosen as
-# tests/e2e/run-e2e.sh describes.
+# Environment:
+#   ZARK_E2E=0            leaves the end-to-end test out (its steps are
+#                         chosen as tests/e2e/run-e2e.sh describes)
+#   ZARK_FUZZ_SECONDS     seconds of fuzzing per target (default 10)
+#   ZARK_HARDENING=0      leaves out ThreadSanitizer, fuzzing and static
+#                         analysis (quick local runs; CI runs them)
 set -euo pipefail
 
 root=$(cd "$(dirname "$0")/.." && pwd)
 jobs=${JOBS:-$(nproc)}
+# shellcheck source=scripts/builds.sh
+. "$root/scripts/builds.sh"
 
-"$root/scripts/install-deps.sh" --e2e
+hardening=${ZARK_HARDENING:-1}
+deps=(--e2e)
+if [ "$hardening" != 0 ]; then
+  deps+=(--hardening)
+fi
+"$root/scripts/install-deps.sh" "${deps[@]}"
 
-run_suite() {
-  local build=$1
-  shift
-  cmake -S "$root" -B "$build" "$@" >/dev/null
-  cmake --build "$build" -j "$jobs"
-  ctest --test-dir "$build" -j "$jobs" --output-on-failure
-}
+step() { echo "== $* ($(date +%T))"; }
 
-# A build folder configured before with another install prefix keeps the
-# host's default folders of that prefix in its cache: the options that make
-# CMake compute them again from /usr.
-forget_other_prefix() {
-  local cached
-  cached=$(sed -n 's/^CMAKE_INSTALL_PREFIX:PATH=//p' "$1/CMakeCache.txt" 2>/dev/null || true)
-  if [ -n "$cached" ] && [ "$cached" != /usr ]; then
-    printf '%s\n' '-UZARK_WEBAPID_*' -UZARK_SYSTEMD_UNITDIR
-  fi
-}
-
-echo "== plain build"
+step "plain build"
 # Prefix /usr as the main job and the package: the end-to-end test installs
 # this build.
-mapfile -t reset < <(forget_other_prefix "$root/build")
-run_suite "$root/build" -DCMAKE_BUILD_TYPE=RelWithDebInfo \
-  -DCMAKE_INSTALL_PREFIX=/usr "${reset[@]}"
+build_plain
+ctest --test-dir "$root/build" -j "$jobs" --output-on-failure
 
-echo "== sanitizer build (address, undefined)"
-ASAN_OPTIONS=detect_leaks=1:abort_on_error=1 \
-UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1 \
-  run_suite "$root/build-asan" -DCMAKE_BUILD_TYPE=Debug \
-    -DZARK_SANITIZE=address,undefined
+step "sanitizer build (address, leak, undefined)"
+build_asan
+ctest --test-dir "$root/build-asan" -j "$jobs" --output-on-failure
 
-echo "== browser front end: build and unit tests"
+if [ "$hardening" != 0 ]; then
+  step "thread sanitizer: host framework and host"
+  bash "$root/scripts/tsan.sh"
+
+  step "bounded fuzzing run"
+  FUZZ_SECONDS=${ZARK_FUZZ_SECONDS:-10} bash "$root/scripts/fuzz.sh"
+
+  step "static analysis"
+  bash "$root/scripts/analyze.sh"
+fi
+
+step "browser front end: build and unit tests"
 bash "$root/www/scripts/check.sh"
 
-echo "== Debian package of the plain build"
+step "Debian package of the plain build"
 bash "$root/packaging/check-deb.sh" "$root/build"
 
 if [ "${ZARK_E2E:-1}" != 0 ]; then
-  echo "== end-to-end browser test (test network, real router)"
+  step "end-to-end browser test (test network, real router)"
   bash "$root/tests/e2e/run-e2e.sh" "$root/build"
 fi
+step "all tests passed"

@@ -1,0 +1,46 @@
+# shellcheck shell=bash
+# The build folders of the test command (scripts/test.sh) and of the figures
+# command (scripts/figures.sh), configured the same way by both. Sourced,
+# not run; the caller sets root (the repository) and jobs.
+#
+#   build        plain RelWithDebInfo build, install prefix /usr (the main
+#                job, the package and the end-to-end test use it)
+#   build-asan   Debug build under AddressSanitizer (with LeakSanitizer) and
+#                UndefinedBehaviorSanitizer
+
+# Options of the sanitizer runs: a leak, an address error or undefined
+# behaviour ends the test process with an error.
+export ASAN_OPTIONS=${ASAN_OPTIONS:-detect_leaks=1:abort_on_error=1}
+export UBSAN_OPTIONS=${UBSAN_OPTIONS:-print_stacktrace=1:halt_on_error=1}
+
+# A build folder configured before with another install prefix keeps the
+# host's default folders of that prefix in its cache: the options that make
+# CMake compute them again from /usr.
+forget_other_prefix() {
+  local cached
+  cached=$(sed -n 's/^CMAKE_INSTALL_PREFIX:PATH=//p' "$1/CMakeCache.txt" 2>/dev/null || true)
+  if [ -n "$cached" ] && [ "$cached" != /usr ]; then
+    printf '%s\n' '-UZARK_WEBAPID_*' -UZARK_SYSTEMD_UNITDIR
+  fi
+}
+
+# Configures and builds folder BUILD with the given CMake options.
+build_folder() {
+  local build=$1
+  shift
+  cmake -S "$root" -B "$build" "$@" >/dev/null
+  cmake --build "$build" -j "$jobs"
+}
+
+build_plain() {
+  local reset
+  mapfile -t reset < <(forget_other_prefix "$root/build")
+  build_folder "$root/build" -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+    -DCMAKE_INSTALL_PREFIX=/usr "${reset[@]}"
+}
+
+build_asan() {
+  # The benchmarks are measured in the plain build only.
+  build_folder "$root/build-asan" -DCMAKE_BUILD_TYPE=Debug \
+    -DZARK_SANITIZE=address,undefined -DZARK_BUILD_BENCH=OFF
+}
