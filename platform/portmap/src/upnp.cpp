@@ -12,10 +12,36 @@
 #include <charconv>
 #include <cstring>
 #include <memory>
+#include <string>
+#include <string_view>
 #include <utility>
 
 namespace zark::portmap {
 namespace {
+
+// The service type as requests carry it (in the SOAPAction header and the
+// body): the description's text without surrounding white space. Empty
+// when what is left holds a character no service URN has (white space,
+// a control character, anything beyond ASCII), which would otherwise end
+// up inside the request's header lines.
+std::string CleanServiceType(std::string_view text) {
+  const auto isSpace = [](char c) {
+    return c == ' ' || c == '\t' || c == '\r' || c == '\n';
+  };
+  while (!text.empty() && isSpace(text.front())) {
+    text.remove_prefix(1);
+  }
+  while (!text.empty() && isSpace(text.back())) {
+    text.remove_suffix(1);
+  }
+  for (const char c : text) {
+    const auto byte = static_cast<unsigned char>(c);
+    if (byte <= 0x20 || byte >= 0x7f) {
+      return {};
+    }
+  }
+  return std::string(text);
+}
 
 // Owns a device list from upnpDiscoverDevices.
 struct DevListDeleter {
@@ -250,10 +276,12 @@ RouterResult UpnpRouter::TryRootDescription(const std::string &url) {
     std::string controlUrl;
   };
   std::vector<Service> services;
-  if (data.first.servicetype[0] != '\0' && urls.Get()->controlURL != nullptr) {
-    services.push_back({data.first.servicetype, urls.Get()->controlURL});
+  const std::string firstType = CleanServiceType(data.first.servicetype);
+  const std::string secondType = CleanServiceType(data.second.servicetype);
+  if (!firstType.empty() && urls.Get()->controlURL != nullptr) {
+    services.push_back({firstType, urls.Get()->controlURL});
   }
-  if (data.second.servicetype[0] != '\0') {
+  if (!secondType.empty()) {
     // Build the second service's control URL the way miniupnpc builds the
     // first one's: with the two swapped.
     IGDdatas swapped = data;
@@ -261,8 +289,7 @@ RouterResult UpnpRouter::TryRootDescription(const std::string &url) {
     OwnedUrls secondUrls;
     GetUPNPUrls(secondUrls.Get(), &swapped, url.c_str(), 0);
     if (secondUrls.Get()->controlURL != nullptr) {
-      services.push_back(
-          {swapped.first.servicetype, secondUrls.Get()->controlURL});
+      services.push_back({secondType, secondUrls.Get()->controlURL});
     }
   }
   if (services.empty()) {
