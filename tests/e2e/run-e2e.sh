@@ -16,9 +16,7 @@
 #    below; then checks the router's mappings with upnpc -l from the server;
 # 5. tears it all down on every exit path.
 #
-# Steps, each "1" (run), "0" (skip) or unset (run when the library call it
-# needs is built, that is no longer in platform/portmap/src/
-# not_built_yet.cpp):
+# Steps, each "1" (run, the default) or "0" (skip):
 #   ZARK_E2E_DETECT        router detection, which must find the router
 #                          (KLibDetectRouter)
 #   ZARK_E2E_ROUTER_STEP   choose "Generic/UPnP IGD", save the configuration
@@ -46,7 +44,6 @@ tn_root=$(cd "$(dirname "$0")/../.." && pwd)
 tn_build=$(realpath "${1:-$tn_root/build}")
 artifacts=${ZARK_E2E_ARTIFACTS:-$tn_root/www/e2e-artifacts}
 time_limit=${ZARK_E2E_TIME_LIMIT:-900}
-not_built="$tn_root/platform/portmap/src/not_built_yet.cpp"
 
 # shellcheck source-path=SCRIPTDIR
 source "$tn_root/tests/e2e/testnet-host.sh"
@@ -65,33 +62,18 @@ command -v node >/dev/null || fail "node is missing (scripts/install-deps.sh)"
 [ -f "$tn_root/www/dist/index.html" ] ||
   fail "www/dist is missing: bash www/scripts/check.sh"
 
-# True when every named library call is built.
-built() {
-  local call
-  for call in "$@"; do
-    if [ -f "$not_built" ] && grep -q "\b$call(" "$not_built"; then
-      return 1
-    fi
-  done
-  return 0
-}
-
-# gate VARIABLE CALL...: the step's setting, "1" or "0".
+# gate VARIABLE: the step's setting, "1" (also when unset) or "0".
 gate() {
-  local variable=$1
-  shift
-  local value=${!variable:-}
-  if [ -z "$value" ]; then
-    if built "$@"; then value=1; else value=0; fi
-  fi
+  local value=${!1:-1}
+  [ "$value" = 0 ] || value=1
   echo "$value"
 }
 
-detect=$(gate ZARK_E2E_DETECT KLibDetectRouter KLibGetRouterDetectResult)
-router_step=$(gate ZARK_E2E_ROUTER_STEP KLibSetRouterConf)
-rules=$(gate ZARK_E2E_RULES KLibSaveRules)
-services=$(gate ZARK_E2E_SERVICES KLibSaveRules)
-reachability=$(gate ZARK_E2E_REACHABILITY KLibTestRulesInit KLibTestRules ZARKIGetExternalIP)
+detect=$(gate ZARK_E2E_DETECT)
+router_step=$(gate ZARK_E2E_ROUTER_STEP)
+rules=$(gate ZARK_E2E_RULES)
+services=$(gate ZARK_E2E_SERVICES)
+reachability=$(gate ZARK_E2E_REACHABILITY)
 if [ "$reachability" = 1 ] && ! [ -x "$tn_build/bin/zark-probed" ]; then
   if [ -n "${ZARK_E2E_REACHABILITY:-}" ]; then
     fail "ZARK_E2E_REACHABILITY=1 needs the probe service: $tn_build/bin/zark-probed is not built"
