@@ -45,13 +45,13 @@
 // 20 ms is what netem's 10 ms on the router's LAN link (on the packets from
 // the router) would cost a request over a new connection, as miniupnpc
 // makes one per request: its SYN-ACK and its reply each come 10 ms late.
-#include "child_process.h"
+#include "base/child_process.h"
+#include "base/unique_fd.h"
+#include "catalog/mapping_state.h"
 #include "counting_relay.h"
 #include "hermetic.h"
 #include "libzarkportmap.h"
-#include "mapping_state.h"
 #include "test_network.h"
-#include "unique_fd.h"
 
 #include <benchmark/benchmark.h>
 

@@ -33,7 +33,7 @@
 #ifndef ZARK_BENCH_COUNTING_RELAY_H
 #define ZARK_BENCH_COUNTING_RELAY_H
 
-#include "unique_fd.h"
+#include "base/unique_fd.h"
 
 #include <netinet/in.h>
 

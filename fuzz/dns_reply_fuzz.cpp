@@ -4,7 +4,7 @@
 // - an accepted reply has an RCODE of 0..15 and no more addresses than the
 //   answer records read;
 // - our own query is not taken as its own reply.
-#include "dns_probe.h"
+#include "detect/dns_probe.h"
 #include "fuzz_support.h"
 #include "syslog_capture.h"
 

@@ -13,11 +13,11 @@
 //   port 1..65535, target
 //   starting with "/"; the URL written back from the parts reads back the
 //   same parts.
+#include "detect/wan_probe.h"
 #include "fuzz_support.h"
-#include "http_download.h"
-#include "probe_client.h"
+#include "net/http_download.h"
+#include "reach/probe_client.h"
 #include "syslog_capture.h"
-#include "wan_probe.h"
 
 #include <cstddef>
 #include <cstdint>

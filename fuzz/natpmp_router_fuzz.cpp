@@ -18,9 +18,9 @@
 //   add answered kConflict names the other port the router granted;
 // - an external address answered kOk is a dotted quad;
 // - reading or listing the table answers kUnsupported without a request.
+#include "base/local_network.h"
+#include "drivers/natpmp.h"
 #include "fuzz_support.h"
-#include "local_network.h"
-#include "natpmp.h"
 #include "scripted_router.h"
 #include "syslog_capture.h"
 

@@ -22,9 +22,9 @@
 //   (127.0.0.1) for a request that was sent.
 #include "connect_back.h"
 #include "fuzz_support.h"
-#include "probe_client.h"
 #include "probe_protocol.h"
 #include "probe_server.h"
+#include "reach/probe_client.h"
 #include "syslog_capture.h"
 
 #include <arpa/inet.h>

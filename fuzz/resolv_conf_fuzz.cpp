@@ -2,7 +2,7 @@
 // (ParseResolvConf). Besides not crashing: at most kMaxNameServers servers,
 // each an address text that inet_pton takes as IPv4 or IPv6 (so nothing
 // else reaches the socket code), without a scope.
-#include "dns_probe.h"
+#include "detect/dns_probe.h"
 #include "fuzz_support.h"
 #include "syslog_capture.h"
 

@@ -6,9 +6,9 @@
 //   metric, the first listed of equal ones) is the one ParseDefaultGateway
 //   answers, and neither finds one without the other;
 // - default routes come lowest metric first and have a gateway.
+#include "base/route_table.h"
+#include "detect/interface_probe.h"
 #include "fuzz_support.h"
-#include "gateway_route.h"
-#include "interface_probe.h"
 #include "syslog_capture.h"
 
 #include <arpa/inet.h>

@@ -5,8 +5,8 @@
 //   record field;
 // - writing it again (SerializeRouterConf) reads back to the same record
 //   and writes the same text.
+#include "catalog/router_conf_store.h"
 #include "fuzz_support.h"
-#include "router_conf_store.h"
 #include "syslog_capture.h"
 
 #include <cstddef>

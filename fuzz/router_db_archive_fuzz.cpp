@@ -6,8 +6,8 @@
 //   "routerdb/" without a "." or ".." component, and is a folder or a
 //   regular file (checked here independently of the parser, on the last
 //   field of each line).
+#include "catalog/router_db_archive.h"
 #include "fuzz_support.h"
-#include "router_db_archive.h"
 #include "syslog_capture.h"
 
 #include <cstddef>

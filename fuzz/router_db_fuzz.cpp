@@ -16,9 +16,9 @@
 //   names and versions that fit a list node;
 // - the C list holds exactly the entries, in the same order, with the same
 //   texts.
+#include "catalog/router_db.h"
 #include "fuzz_support.h"
 #include "libzarkportmap.h"
-#include "router_db.h"
 #include "syslog_capture.h"
 
 #include <cstddef>

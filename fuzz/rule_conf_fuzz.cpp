@@ -5,7 +5,7 @@
 // - writing the accepted rules (SerializeRuleConf) gives a text that reads
 //   back to the same rules, field by field, and writes the same text again.
 #include "fuzz_support.h"
-#include "rule_conf_format.h"
+#include "rules/rule_conf_format.h"
 #include "syslog_capture.h"
 
 #include <cstddef>

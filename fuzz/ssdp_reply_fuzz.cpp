@@ -3,7 +3,7 @@
 // LOCATION that is an "http://" URL of at most 512 printable characters,
 // since it is the next thing the library fetches.
 #include "fuzz_support.h"
-#include "ssdp_search.h"
+#include "net/ssdp_search.h"
 #include "syslog_capture.h"
 
 #include <cstddef>

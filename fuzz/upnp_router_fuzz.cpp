@@ -24,11 +24,11 @@
 // - an add answered kOk was confirmed: the router was asked
 //   GetSpecificPortMappingEntry after the AddPortMapping;
 // - a mapping or address answered kOk is well-formed (dotted quad, port).
+#include "base/local_network.h"
+#include "drivers/upnp.h"
 #include "fuzz_support.h"
-#include "local_network.h"
 #include "scripted_router.h"
 #include "syslog_capture.h"
-#include "upnp.h"
 
 #include <cstddef>
 #include <cstdint>

@@ -97,7 +97,8 @@ set(CPACK_DEBIAN_PACKAGE_DEPENDS
     "libc6 (>= 2.34), libstdc++6 (>= 12), libgcc-s1 (>= 3.0), \
 libjsoncpp25 (>= 1.9.5), libminiupnpc17 (>= 2.0.20171212), \
 libnatpmp1 (>= 20150609), libcpp-httplib0.11 (>= 0.11.4+ds), \
-libcrypt1 (>= 1:4.1.0), tar")
+libcrypt1 (>= 1:4.1.0), libexpat1 (>= 2.5.0), libc-ares2 (>= 1.18.1), \
+libarchive13 (>= 3.6.2), tar")
 # Debug information stays in the build folder.
 set(CPACK_STRIP_FILES TRUE)
 set(CPACK_DEBIAN_PACKAGE_RECOMMENDS "systemd")

@@ -99,7 +99,8 @@ for ((i = 1; i + 1 < ${#exec_start[@]}; i++)); do
 done
 
 depends=$(dpkg-deb -f "$deb" Depends)
-for package in libjsoncpp25 libminiupnpc17 libnatpmp1 libcpp-httplib0.11 libcrypt1; do
+for package in libjsoncpp25 libminiupnpc17 libnatpmp1 libcpp-httplib0.11 libcrypt1 \
+  libexpat1 libc-ares2 libarchive13; do
   if ! grep -q "\b$package\b" <<<"$depends"; then
     echo "check-deb: Depends lacks $package: $depends" >&2
     failures=$((failures + 1))

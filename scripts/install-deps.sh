@@ -26,6 +26,7 @@ packages=(
   libminiupnpc-dev libnatpmp-dev miniupnpc natpmpc
   miniupnpd-nftables nftables
   libcpp-httplib-dev libcrypt-dev
+  libexpat1-dev libc-ares-dev libarchive-dev
   # demo and end-to-end tests: the relay from the machine into the test
   # network, and the test network's name server
   socat dnsmasq-base

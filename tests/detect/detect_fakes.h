@@ -7,7 +7,7 @@
 #ifndef ZARK_TESTS_DETECT_DETECT_FAKES_H
 #define ZARK_TESTS_DETECT_DETECT_FAKES_H
 
-#include "detect_router.h"
+#include "detect/detect_router.h"
 
 #include <chrono>
 #include <mutex>

@@ -2,11 +2,11 @@
 // files: SSDP answers, DNS replies, root descriptions, resolv.conf, the
 // kept result, WAN host lists. The first byte picks the parser. Besides
 // not crashing, each parse must keep its promises.
-#include "detect_result_store.h"
-#include "dns_probe.h"
-#include "igd_description.h"
-#include "ssdp_search.h"
-#include "wan_probe.h"
+#include "catalog/detect_result_store.h"
+#include "detect/dns_probe.h"
+#include "detect/wan_probe.h"
+#include "net/igd_description.h"
+#include "net/ssdp_search.h"
 
 #include <arpa/inet.h>
 

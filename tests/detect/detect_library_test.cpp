@@ -3,16 +3,16 @@
 // KLibGetRouterDetectResult, refuses a second run at once; and
 // ZARKIGetExternalIP asks the configured router, then a probe, then the
 // probe service.
+#include "catalog/detect_result_store.h"
 #include "detect_fakes.h"
-#include "detect_result_store.h"
-#include "external_address.h"
+#include "drivers/natpmp.h"
+#include "drivers/upnp.h"
 #include "fake_igd.h"
 #include "fake_natpmp.h"
 #include "hermetic.h"
 #include "libzarkportmap.h"
-#include "natpmp.h"
+#include "reach/external_address.h"
 #include "syslog_capture.h"
-#include "upnp.h"
 #include "zarknet.h"
 
 #include <arpa/inet.h>
@@ -189,10 +189,10 @@ protected:
       return mConf;
     };
     environment.makeRouter =
-        [this](std::string_view protocol,
-               const std::string &gateway) -> std::unique_ptr<RouterProtocol> {
-      mMade.emplace_back(protocol);
-      if (protocol == "upnp") {
+        [this](RouterProtocol protocol,
+               const std::string &gateway) -> std::unique_ptr<RouterDriver> {
+      mMade.emplace_back(RouterProtocolName(protocol));
+      if (protocol == RouterProtocol::kUpnp) {
         UpnpOptions options;
         options.gateway = gateway;
         options.knownRootDescUrls = {mIgd.RootDescUrl()};

@@ -1,11 +1,11 @@
 // The pure parts of detection: address classes, routes and interfaces,
 // WAN host lists, hop counts, resolv.conf and DNS messages, SSDP answers,
 // router names, and the kept result's file format.
+#include "base/ipv4_class.h"
+#include "catalog/detect_result_store.h"
 #include "detect_fakes.h"
-#include "detect_result_store.h"
 #include "dns_answer.h"
-#include "ipv4_class.h"
-#include "ssdp_search.h"
+#include "net/ssdp_search.h"
 
 #include "syslog_capture.h"
 

@@ -6,8 +6,8 @@
 #include "dns_answer.h"
 #include "fake_igd.h"
 #include "fake_natpmp.h"
-#include "igd_description.h"
-#include "ssdp_search.h"
+#include "net/igd_description.h"
+#include "net/ssdp_search.h"
 #include "udp_responder.h"
 
 #include "syslog_capture.h"

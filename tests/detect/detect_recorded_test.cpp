@@ -1,7 +1,7 @@
 // Recorded SSDP answers and root descriptions (data/, see its README)
 // against the parse written beside each.
-#include "igd_description.h"
-#include "ssdp_search.h"
+#include "net/igd_description.h"
+#include "net/ssdp_search.h"
 
 #include <gtest/gtest.h>
 

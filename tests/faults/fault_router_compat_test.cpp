@@ -11,8 +11,8 @@
 // on the router, passes with the router's 60, and leaves nothing behind.
 #include "fault_support.h"
 
+#include "base/library_config.h"
 #include "db_test_support.h"
-#include "library_config.h"
 #include "libzarkportmap.h"
 #include "webapi.h"
 

@@ -10,7 +10,7 @@
 // of SSDP search, 875 ms of NAT-PMP tries, 1 s for the description) with
 // the router step "failed", release its lock, and succeed once the router
 // is back.
-#include "detect_router.h"
+#include "detect/detect_router.h"
 #include "detect_support.h"
 #include "fault_support.h"
 #include "outside_services.h"

@@ -15,8 +15,8 @@
 #include "fault_support.h"
 
 #include "RouterRuleConf.h"
+#include "base/library_config.h"
 #include "db_test_support.h"
-#include "library_config.h"
 #include "libzarkportmap.h"
 #include "webapi.h"
 

@@ -1,6 +1,6 @@
 #include "db_test_support.h"
 
-#include "child_process.h"
+#include "base/child_process.h"
 #include "hermetic.h"
 #include "klibc.h"
 

@@ -1,10 +1,10 @@
 #include "detect_support.h"
 
+#include "base/library_config.h"
+#include "catalog/router_conf_store.h"
 #include "hermetic.h"
 #include "klibc.h"
-#include "library_config.h"
 #include "outside_services.h"
-#include "router_conf_store.h"
 
 #include <sys/stat.h>
 #include <unistd.h>

@@ -7,9 +7,9 @@
 // 606, and the test reports 24.
 #include "integration_fixture.h"
 
-#include "library_config.h"
-#include "tested_router_db.h"
-#include "upnp_compat_test.h"
+#include "base/library_config.h"
+#include "compat/compatibility_test.h"
+#include "compat/tested_router_db.h"
 
 #include <memory>
 #include <thread>

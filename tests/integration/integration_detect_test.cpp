@@ -4,10 +4,10 @@
 // name "TestIGD", model number "1"). The outside host runs a name server
 // and a WAN probe listener (outside_services.h). Then RouterConf set after
 // a real detection, and the external address.
+#include "catalog/router_conf_store.h"
 #include "detect_support.h"
 #include "integration_fixture.h"
 #include "outside_services.h"
-#include "router_conf_store.h"
 #include "zarknet.h"
 
 #include <arpa/inet.h>

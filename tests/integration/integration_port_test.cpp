@@ -6,7 +6,7 @@
 #include "integration_fixture.h"
 
 #include "RouterRuleConf.h"
-#include "library_config.h"
+#include "base/library_config.h"
 
 #include <netinet/in.h>
 #include <sys/socket.h>

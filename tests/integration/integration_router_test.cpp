@@ -4,8 +4,8 @@
 #include "detect_support.h"
 #include "integration_fixture.h"
 
-#include "library_config.h"
-#include "router_conf_store.h"
+#include "base/library_config.h"
+#include "catalog/router_conf_store.h"
 
 #include <sys/stat.h>
 

@@ -1,8 +1,8 @@
 // The library configuration file and the helper-program runner (private
 // mount namespace).
-#include "child_process.h"
+#include "base/child_process.h"
+#include "base/library_config.h"
 #include "hermetic.h"
-#include "library_config.h"
 #include "syslog_capture.h"
 
 #include <gtest/gtest.h>

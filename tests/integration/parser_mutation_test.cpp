@@ -2,8 +2,8 @@
 // many mutations of valid inputs (fixed seed, so every run is the same):
 // neither crashes (the sanitizer build watches), and whatever they accept
 // keeps their promises.
-#include "router_conf_store.h"
-#include "router_db_archive.h"
+#include "catalog/router_conf_store.h"
+#include "catalog/router_db_archive.h"
 
 #include <gtest/gtest.h>
 

@@ -2,9 +2,9 @@
 // against real files under /etc/portforward (private mount namespace).
 #include "libzarkportmap.h"
 
+#include "catalog/router_conf_store.h"
 #include "db_test_support.h"
 #include "hermetic.h"
-#include "router_conf_store.h"
 #include "syslog_capture.h"
 
 #include <gtest/gtest.h>

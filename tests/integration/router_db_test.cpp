@@ -3,11 +3,11 @@
 // mount namespace).
 #include "libzarkportmap.h"
 
+#include "catalog/router_conf_store.h"
+#include "catalog/router_db.h"
 #include "db_test_support.h"
 #include "hermetic.h"
 #include "klibc.h"
-#include "router_conf_store.h"
-#include "router_db.h"
 #include "syslog_capture.h"
 
 #include <gtest/gtest.h>

@@ -3,13 +3,13 @@
 // whole (private mount namespace; the HTTP server listens on loopback).
 #include "libzarkportmap.h"
 
+#include "base/library_config.h"
+#include "catalog/router_db.h"
+#include "catalog/router_db_archive.h"
+#include "catalog/router_db_update.h"
 #include "db_test_support.h"
 #include "hermetic.h"
-#include "http_download.h"
-#include "library_config.h"
-#include "router_db.h"
-#include "router_db_archive.h"
-#include "router_db_update.h"
+#include "net/http_download.h"
 #include "syslog_capture.h"
 
 #include <gtest/gtest.h>

@@ -6,7 +6,7 @@
 #ifndef ZARK_TESTS_LOAD_HOST_SYSLOG_H
 #define ZARK_TESTS_LOAD_HOST_SYSLOG_H
 
-#include "unique_fd.h"
+#include "base/unique_fd.h"
 
 #include <cstddef>
 #include <deque>

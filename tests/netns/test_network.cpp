@@ -1,6 +1,6 @@
 #include "test_network.h"
 
-#include "child_process.h"
+#include "base/child_process.h"
 
 #include <arpa/inet.h>
 #include <fcntl.h>

@@ -1,5 +1,5 @@
 // Picking the default gateway out of /proc/net/route texts.
-#include "gateway_route.h"
+#include "base/route_table.h"
 #include "libzarkportmap.h"
 
 #include "syslog_capture.h"

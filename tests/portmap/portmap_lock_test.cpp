@@ -3,8 +3,8 @@
 // and order is shown by recorded events, not by clocks.
 #include "libzarkportmap.h"
 
+#include "base/portmap_lock.h"
 #include "hermetic.h"
-#include "portmap_lock_internal.h"
 #include "syslog_capture.h"
 
 #include <gtest/gtest.h>

@@ -1,6 +1,6 @@
 // The rule configuration text: what SerializeRuleConf writes comes back
 // unchanged from ParseRuleConf, and anything else is refused as a whole.
-#include "rule_conf_format.h"
+#include "rules/rule_conf_format.h"
 
 #include <gtest/gtest.h>
 #include <json/json.h>

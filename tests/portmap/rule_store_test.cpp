@@ -4,7 +4,7 @@
 #include "libzarkportmap.h"
 
 #include "hermetic.h"
-#include "rule_conf_format.h"
+#include "rules/rule_conf_format.h"
 #include "syslog_capture.h"
 
 #include <gtest/gtest.h>

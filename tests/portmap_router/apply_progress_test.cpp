@@ -1,5 +1,5 @@
 // Progress percentages and lines of applying rules. Pure.
-#include "apply_progress.h"
+#include "apply/apply_progress.h"
 
 #include <gtest/gtest.h>
 

@@ -1,6 +1,6 @@
 // Which hosts count as the local network: the check that keeps a forged
 // UPnP description from sending our requests elsewhere. Pure functions.
-#include "local_network.h"
+#include "base/local_network.h"
 
 #include <gtest/gtest.h>
 

@@ -1,6 +1,6 @@
 // The mapping state's file text: what is written is read back the same,
 // and anything else is refused. Pure.
-#include "mapping_state.h"
+#include "catalog/mapping_state.h"
 
 #include <gtest/gtest.h>
 
@@ -11,14 +11,14 @@ namespace {
 
 MappingState Sample() {
   MappingState state;
-  RouterRecord &upnp = state.FindOrAdd("192.168.1.1", "upnp");
+  RouterRecord &upnp = state.FindOrAdd("192.168.1.1", RouterProtocol::kUpnp);
   upnp.location = "http://192.168.1.1:5000/rootDesc.xml";
   upnp.finiteLeases = true;
   upnp.Put({IpProtocol::kTcp, 8080, 80, "192.168.1.10", 3600, 1700003600, true,
             "1"});
   upnp.Put({IpProtocol::kUdp, 5000, 5000, "192.168.1.10", 0, 0, false,
             "rule \"two\""});
-  RouterRecord &natpmp = state.FindOrAdd("10.0.0.1", "natpmp");
+  RouterRecord &natpmp = state.FindOrAdd("10.0.0.1", RouterProtocol::kNatPmp);
   natpmp.Put(
       {IpProtocol::kTcp, 22, 2222, "10.0.0.5", 7200, 1700007200, true, "ssh"});
   return state;
@@ -35,9 +35,9 @@ TEST(PortMapRouterMappingState, RoundTrips) {
 
 TEST(PortMapRouterMappingState, RecordsAreFoundByGatewayAndProtocol) {
   MappingState state = Sample();
-  ASSERT_NE(nullptr, state.Find("192.168.1.1", "upnp"));
-  EXPECT_EQ(nullptr, state.Find("192.168.1.1", "natpmp"));
-  RouterRecord *record = state.Find("192.168.1.1", "upnp");
+  ASSERT_NE(nullptr, state.Find("192.168.1.1", RouterProtocol::kUpnp));
+  EXPECT_EQ(nullptr, state.Find("192.168.1.1", RouterProtocol::kNatPmp));
+  RouterRecord *record = state.Find("192.168.1.1", RouterProtocol::kUpnp);
   ASSERT_NE(nullptr, record->Find(IpProtocol::kUdp, 5000));
   EXPECT_EQ(nullptr, record->Find(IpProtocol::kTcp, 5000));
   record->Remove(IpProtocol::kUdp, 5000);
@@ -49,11 +49,11 @@ TEST(PortMapRouterMappingState, RecordsAreFoundByGatewayAndProtocol) {
 
 TEST(PortMapRouterMappingState, DropsOnlyRecordsWithNothingToRemember) {
   MappingState state;
-  state.FindOrAdd("192.168.1.1", "upnp").location = "http://x/";
-  state.FindOrAdd("192.168.1.1", "natpmp");
+  state.FindOrAdd("192.168.1.1", RouterProtocol::kUpnp).location = "http://x/";
+  state.FindOrAdd("192.168.1.1", RouterProtocol::kNatPmp);
   state.DropEmpty();
   ASSERT_EQ(1u, state.routers.size());
-  EXPECT_EQ("upnp", state.routers[0].protocol);
+  EXPECT_EQ(RouterProtocol::kUpnp, state.routers[0].protocol);
 }
 
 TEST(PortMapRouterMappingState, RefusesWhatItDoesNotWrite) {
@@ -111,7 +111,7 @@ TEST(PortMapRouterMappingState, IgnoresMembersItDoesNotKnow) {
   std::string why;
   ASSERT_TRUE(ParseMappingState(text, state, why)) << why;
   ASSERT_EQ(1u, state.routers.size());
-  EXPECT_EQ("natpmp", state.routers[0].protocol);
+  EXPECT_EQ(RouterProtocol::kNatPmp, state.routers[0].protocol);
 }
 
 } // namespace

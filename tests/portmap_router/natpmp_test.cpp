@@ -1,7 +1,7 @@
 // The NAT-PMP driver against the fake UDP responder on loopback: public
 // address, map, unmap, a port taken by another device, router errors, the
 // bounded retry schedule, and recorded replies (tests/data/natpmp).
-#include "natpmp.h"
+#include "drivers/natpmp.h"
 
 #include "fake_natpmp.h"
 #include "syslog_capture.h"

@@ -1,6 +1,6 @@
 // Recorded router replies (tests/data/upnp/*.xml) served by the fake IGD:
 // the driver must read each one as the .expect file beside it says.
-#include "upnp.h"
+#include "drivers/upnp.h"
 
 #include "fake_igd.h"
 

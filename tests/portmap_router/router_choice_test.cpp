@@ -5,12 +5,11 @@
 // detection record when it names the same router; otherwise the refusal of
 // routers driven through their pages. HERMETIC: real files under
 // /etc/portforward and /etc.defaults in a private mount namespace.
-#include "detect_result_store.h"
+#include "catalog/detect_result_store.h"
+#include "catalog/router_conf_store.h"
+#include "drivers/driver_choice.h"
 #include "hermetic.h"
 #include "libzarkportmap.h"
-#include "protocol_inference.h"
-#include "router_conf_store.h"
-#include "router_driver.h"
 #include "syslog_capture.h"
 
 #include <gtest/gtest.h>
@@ -97,7 +96,7 @@ protected:
     }
     EXPECT_EQ(ZARK_PORTMAP_ERR_NONE, mErr);
     EXPECT_EQ(32, choice.maxRouterEntries);
-    return choice.protocol;
+    return std::string(RouterProtocolName(choice.protocol));
   }
 
   std::string Logs() const {

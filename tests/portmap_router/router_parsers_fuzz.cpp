@@ -8,9 +8,9 @@
 //   that is a dotted quad in the given network.
 #include "router_parsers_fuzz.h"
 
-#include "local_network.h"
-#include "mapping_state.h"
-#include "rule_validation.h"
+#include "base/local_network.h"
+#include "catalog/mapping_state.h"
+#include "rules/rule_validation.h"
 
 #include <cstddef>
 #include <cstdint>

@@ -1,6 +1,6 @@
 // Checking rule sets and expanding them into single-port mappings: every
 // refusal type with its limit or offending text. Pure.
-#include "rule_validation.h"
+#include "rules/rule_validation.h"
 
 #include <gtest/gtest.h>
 

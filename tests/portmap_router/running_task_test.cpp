@@ -1,6 +1,6 @@
 // The running-job mark: seen while held, in this process and others, and
 // gone when its process is killed. HERMETIC (/etc/portforward).
-#include "running_task.h"
+#include "base/running_task.h"
 
 #include "hermetic.h"
 #include "libzarkportmap.h"

@@ -3,16 +3,16 @@
 // configuration, failures that leave a truthful state for the next save.
 // HERMETIC: real files under /etc/portforward and /tmp in a private mount
 // namespace.
-#include "save_rules.h"
+#include "apply/save_rules.h"
 
 #include "RouterRuleConf.h"
+#include "catalog/mapping_state.h"
+#include "catalog/router_conf_store.h"
+#include "drivers/driver_choice.h"
 #include "fake_igd.h"
 #include "fake_natpmp.h"
 #include "hermetic.h"
 #include "libzarkportmap.h"
-#include "mapping_state.h"
-#include "router_conf_store.h"
-#include "router_driver.h"
 #include "syslog_capture.h"
 
 #include <gtest/gtest.h>
@@ -173,7 +173,7 @@ TEST_F(PortMapRouterSave, AppliesThreeRulesOneOfThemARange) {
   EXPECT_EQ("svc", saved[1].serviceId);
 
   MappingState state = State();
-  RouterRecord *record = state.Find(kGateway, "upnp");
+  RouterRecord *record = state.Find(kGateway, RouterProtocol::kUpnp);
   ASSERT_NE(nullptr, record);
   EXPECT_EQ(mIgd.RootDescUrl(), record->location);
   EXPECT_EQ(5u, record->mappings.size());
@@ -348,7 +348,7 @@ TEST_F(PortMapRouterSave, ConflictIsReportedForItsRuleAndTheRestApplied) {
   ASSERT_EQ(1u, SavedRules().size());
   EXPECT_EQ("old", SavedRules()[0].ruleId);
   MappingState state = State();
-  RouterRecord *record = state.Find(kGateway, "upnp");
+  RouterRecord *record = state.Find(kGateway, RouterProtocol::kUpnp);
   ASSERT_NE(nullptr, record);
   ASSERT_EQ(1u, record->mappings.size());
   EXPECT_EQ(2222, record->mappings[0].externalPort);
@@ -379,7 +379,7 @@ TEST_F(PortMapRouterSave, RouterThatClosesMidSaveEndsItAndTheNextSaveRepairs) {
   EXPECT_EQ(3, mIgd.Count("AddPortMapping")); // stopped at the first silence
   EXPECT_NE(0, ::access(ZARK_PORTMAP_RULE_CONF, F_OK)); // nothing saved
   MappingState state = State();
-  RouterRecord *record = state.Find(kGateway, "upnp");
+  RouterRecord *record = state.Find(kGateway, RouterProtocol::kUpnp);
   ASSERT_NE(nullptr, record);
   ASSERT_EQ(3u, record->mappings.size());
   EXPECT_TRUE(record->mappings[0].held);
@@ -436,7 +436,7 @@ TEST_F(PortMapRouterSave, FullTableStopsTheAddStage) {
   EXPECT_NE(nullptr, std::strstr(mResult.detail.text, "table full"));
   EXPECT_EQ(3, mIgd.Count("AddPortMapping"));
   MappingState state = State();
-  EXPECT_EQ(2u, state.Find(kGateway, "upnp")->mappings.size());
+  EXPECT_EQ(2u, state.Find(kGateway, RouterProtocol::kUpnp)->mappings.size());
 }
 
 TEST_F(PortMapRouterSave, AddThatCannotBeReadBackStaysUncertain) {
@@ -453,7 +453,7 @@ TEST_F(PortMapRouterSave, AddThatCannotBeReadBackStaysUncertain) {
   // Both were tried: a reply that cannot be read back stops nothing.
   EXPECT_EQ(2, mIgd.Count("AddPortMapping"));
   MappingState state = State();
-  RouterRecord *record = state.Find(kGateway, "upnp");
+  RouterRecord *record = state.Find(kGateway, RouterProtocol::kUpnp);
   ASSERT_NE(nullptr, record);
   ASSERT_EQ(2u, record->mappings.size());
   EXPECT_FALSE(record->mappings[0].held);
@@ -479,8 +479,8 @@ TEST_F(PortMapRouterSave, TheJobStopsWhenItsTimeIsUp) {
   EXPECT_EQ(5u, result.errType);
   EXPECT_NE(nullptr, std::strstr(result.detail.text, "ran out of time"));
   EXPECT_EQ(0, mIgd.Count("AddPortMapping"));
-  EXPECT_TRUE(State().Find(kGateway, "upnp") == nullptr ||
-              State().Find(kGateway, "upnp")->mappings.empty());
+  EXPECT_TRUE(State().Find(kGateway, RouterProtocol::kUpnp) == nullptr ||
+              State().Find(kGateway, RouterProtocol::kUpnp)->mappings.empty());
 }
 
 TEST_F(PortMapRouterSave, VerifyFlagReaddsWhatTheRouterLost) {
@@ -520,8 +520,9 @@ TEST_F(PortMapRouterSave, FiniteLeasesAreRefreshedWhenTheyRunLow) {
   ASSERT_EQ(0, ApplyRules(kGateway, rules, ApplyOptions{}, environment, result,
                           nullptr, nullptr));
   MappingState state = State();
-  ASSERT_EQ(now + 3600, state.Find(kGateway, "upnp")->mappings[0].expires);
-  EXPECT_TRUE(state.Find(kGateway, "upnp")->finiteLeases);
+  ASSERT_EQ(now + 3600,
+            state.Find(kGateway, RouterProtocol::kUpnp)->mappings[0].expires);
+  EXPECT_TRUE(state.Find(kGateway, RouterProtocol::kUpnp)->finiteLeases);
   ApplyOptions renew;
   renew.refreshLeases = true;
   renew.writeRuleConf = false;
@@ -541,7 +542,8 @@ TEST_F(PortMapRouterSave, FiniteLeasesAreRefreshedWhenTheyRunLow) {
                                         {"AddPortMapping", 1},
                                         {"GetSpecificPortMappingEntry", 1}}),
             mIgd.Counts());
-  EXPECT_EQ(now + 3600, State().Find(kGateway, "upnp")->mappings[0].expires);
+  EXPECT_EQ(now + 3600,
+            State().Find(kGateway, RouterProtocol::kUpnp)->mappings[0].expires);
 }
 
 TEST_F(PortMapRouterSave, NatPmpRouterEndToEnd) {
@@ -561,7 +563,7 @@ TEST_F(PortMapRouterSave, NatPmpRouterEndToEnd) {
                                               {1, 53, 5353, 7200}}),
             mNatPmp.Table());
   MappingState state = State();
-  RouterRecord *record = state.Find(kGateway, "natpmp");
+  RouterRecord *record = state.Find(kGateway, RouterProtocol::kNatPmp);
   ASSERT_NE(nullptr, record);
   EXPECT_TRUE(record->finiteLeases);
   ASSERT_EQ(2u, record->mappings.size());
@@ -610,9 +612,9 @@ TEST_F(PortMapRouterSave, SwitchingProtocolsDeletesThroughTheOldOne) {
   EXPECT_EQ(5, mIgd.Count("DeletePortMapping"));
   EXPECT_EQ(5u, mNatPmp.Table().size());
   MappingState state = State();
-  EXPECT_TRUE(state.Find(kGateway, "upnp") == nullptr ||
-              state.Find(kGateway, "upnp")->mappings.empty());
-  EXPECT_EQ(5u, state.Find(kGateway, "natpmp")->mappings.size());
+  EXPECT_TRUE(state.Find(kGateway, RouterProtocol::kUpnp) == nullptr ||
+              state.Find(kGateway, RouterProtocol::kUpnp)->mappings.empty());
+  EXPECT_EQ(5u, state.Find(kGateway, RouterProtocol::kNatPmp)->mappings.size());
 }
 
 TEST_F(PortMapRouterSave, ChangedLocalPortIsDeletedThenAdded) {
@@ -637,7 +639,7 @@ TEST_F(PortMapRouterSave, CorruptStateIsLoggedAndRebuilt) {
   ASSERT_EQ(0, Save({Rule("web", "tcp", "8080", "80")}));
 
   EXPECT_TRUE(test::HasLogContaining("the mappings made before are unknown"));
-  EXPECT_EQ(1u, State().Find(kGateway, "upnp")->mappings.size());
+  EXPECT_EQ(1u, State().Find(kGateway, RouterProtocol::kUpnp)->mappings.size());
 }
 
 } // namespace

@@ -4,12 +4,12 @@
 #include "zarkportforward_tool.h"
 
 #include "RouterRuleConf.h"
+#include "base/portmap_lock.h"
+#include "catalog/router_conf_store.h"
+#include "drivers/driver_choice.h"
 #include "fake_igd.h"
 #include "fake_natpmp.h"
 #include "hermetic.h"
-#include "portmap_lock_internal.h"
-#include "router_conf_store.h"
-#include "router_driver.h"
 #include "syslog_capture.h"
 
 #include <gtest/gtest.h>

@@ -1,7 +1,7 @@
 // The UPnP driver against the fake IGD on loopback: choosing the service,
 // lease refusals, conflicts, routers that drop or garble what they were
 // asked, control URLs off the network, a router that stops answering.
-#include "upnp.h"
+#include "drivers/upnp.h"
 
 #include "fake_igd.h"
 #include "syslog_capture.h"

@@ -9,18 +9,18 @@
 // Every case ends with the fake's table as it was before the test: the
 // test removes every mapping it made, whatever happened.
 // HERMETIC: /etc/portforward, /tmp.
-#include "upnp_compat_test.h"
+#include "compat/compatibility_test.h"
 
+#include "base/library_config.h"
+#include "base/portmap_lock.h"
+#include "base/running_task.h"
+#include "catalog/router_conf_store.h"
+#include "compat/compatibility_report.h"
+#include "drivers/driver_choice.h"
 #include "fake_igd.h"
 #include "hermetic.h"
-#include "library_config.h"
-#include "portmap_lock_internal.h"
 #include "porttest_support.h"
-#include "router_conf_store.h"
-#include "router_driver.h"
-#include "running_task.h"
 #include "syslog_capture.h"
-#include "upnp_test_report.h"
 
 #include "klibc.h"
 
@@ -312,7 +312,7 @@ TEST_F(PortTestCompat, PortsInUseAreLeftAlone) {
                              0,           "someone else"};
   mIgd.PutEntry(other);
   MappingState state;
-  RouterRecord &record = state.FindOrAdd("127.0.0.1", "upnp");
+  RouterRecord &record = state.FindOrAdd("127.0.0.1", RouterProtocol::kUpnp);
   RecordedMapping rule;
   rule.protocol = IpProtocol::kTcp;
   rule.externalPort = static_cast<uint16_t>(mFirst + 5);

@@ -4,10 +4,10 @@
 // router port, so a rule whose router port equals its local port is
 // "forwarded" and one whose router port has nothing behind it is not.
 // HERMETIC: /tmp/pfStatusRule and /etc/portforward/portmap.conf.
-#include "port_test.h"
+#include "reach/reachability_test.h"
 
+#include "base/library_config.h"
 #include "hermetic.h"
-#include "library_config.h"
 #include "porttest_support.h"
 #include "syslog_capture.h"
 

@@ -2,12 +2,12 @@
 // how rules become port checks and their results a line of the status
 // file, the UDP listener's answer, and the small files of the UPnP test
 // (run file, report, database of tested routers).
-#include "port_test.h"
-#include "probe_client.h"
-#include "tested_router_db.h"
-#include "token_listener.h"
-#include "upnp_compat_test.h"
-#include "upnp_test_report.h"
+#include "compat/compatibility_report.h"
+#include "compat/compatibility_test.h"
+#include "compat/tested_router_db.h"
+#include "reach/probe_client.h"
+#include "reach/reachability_test.h"
+#include "reach/token_listener.h"
 
 #include "porttest_support.h"
 

@@ -3,7 +3,7 @@
 // the pieces that matter to the parser, all through the fuzz target's
 // checks.
 #include "probe_answer_fuzz.h"
-#include "probe_client.h"
+#include "reach/probe_client.h"
 
 #include <gtest/gtest.h>
 

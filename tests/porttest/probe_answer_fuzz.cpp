@@ -5,7 +5,7 @@
 // or more, an error a reason; and a line over 512 bytes is never accepted.
 #include "probe_answer_fuzz.h"
 
-#include "probe_client.h"
+#include "reach/probe_client.h"
 
 #include <cstddef>
 #include <cstdint>

@@ -1,6 +1,6 @@
 // The database of tested routers through KLibWriteRecordIntoUpnpDB.
 // HERMETIC: /etc/portforward.
-#include "tested_router_db.h"
+#include "compat/tested_router_db.h"
 
 #include "hermetic.h"
 #include "syslog_capture.h"

@@ -1,14 +1,14 @@
 // Uploading a failed test's report (KLibUploadTestUpnpCompatibilityFailResult)
 // to an HTTP server on 127.0.0.1 (cpp-httplib), with the router's
 // description from the fake router. HERMETIC: /etc/portforward, /tmp.
-#include "upnp_test_report.h"
+#include "compat/compatibility_report.h"
 
+#include "base/library_config.h"
+#include "compat/compatibility_test.h"
 #include "fake_igd.h"
 #include "hermetic.h"
-#include "library_config.h"
 #include "porttest_support.h"
 #include "syslog_capture.h"
-#include "upnp_compat_test.h"
 
 #include <httplib.h>
 #include <json/json.h>

@@ -10,10 +10,10 @@
 // RouterConf get answers the brand, model, version, protocols, port and
 // rule limit; it returns neither the account nor the password, so its
 // answer is held to the same rule as every other.
+#include "base/library_config.h"
 #include "db_test_support.h"
 #include "detect_support.h"
 #include "hermetic.h"
-#include "library_config.h"
 #include "outside_services.h"
 #include "security_support.h"
 #include "test_network.h"

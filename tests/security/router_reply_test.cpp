@@ -17,13 +17,13 @@
 // a user-info part, redirects of the description and of SOAP requests,
 // the location remembered from an earlier job, the NAT-PMP path, and
 // detection's SSDP answers.
+#include "apply/save_rules.h"
+#include "catalog/mapping_state.h"
 #include "db_test_support.h"
+#include "detect/router_probe.h"
+#include "drivers/driver_choice.h"
 #include "hermetic.h"
 #include "libzarkportmap.h"
-#include "mapping_state.h"
-#include "router_driver.h"
-#include "router_probe.h"
-#include "save_rules.h"
 #include "scripted_igd.h"
 #include "security_support.h"
 #include "syslog_capture.h"
@@ -234,7 +234,8 @@ TEST_F(SecurityRouterReplies, RedirectOfASoapRequestIsNotFollowed) {
 TEST_F(SecurityRouterReplies, RememberedLocationOffTheNetworkIsRefused) {
   Configure("yes", "no");
   zark::portmap::MappingState state;
-  zark::portmap::RouterRecord &record = state.FindOrAdd(mNet.lanRouter, "upnp");
+  zark::portmap::RouterRecord &record =
+      state.FindOrAdd(mNet.lanRouter, zark::portmap::RouterProtocol::kUpnp);
   record.location = Elsewhere("/rootDesc.xml");
   ASSERT_TRUE(
       zark::portmap::SaveMappingState(zark::portmap::kMappingStatePath, state));
@@ -248,7 +249,8 @@ TEST_F(SecurityRouterReplies, RememberedLocationOffTheNetworkIsRefused) {
   zark::portmap::MappingState after;
   ASSERT_TRUE(
       zark::portmap::LoadMappingState(zark::portmap::kMappingStatePath, after));
-  zark::portmap::RouterRecord *used = after.Find(mNet.lanRouter, "upnp");
+  zark::portmap::RouterRecord *used =
+      after.Find(mNet.lanRouter, zark::portmap::RouterProtocol::kUpnp);
   ASSERT_NE(nullptr, used);
   EXPECT_EQ(mNet.rootDesc, used->location);
   ExpectNothingWentElsewhere();
@@ -263,7 +265,8 @@ TEST_F(SecurityRouterReplies, NatPmpSaveTalksToTheGatewayOnly) {
       mNet.outsideNs, SOCK_DGRAM, mNet.wanOutside, 5351));
   ASSERT_TRUE(outsideNatPmp.Ok());
   zark::portmap::MappingState state;
-  zark::portmap::RouterRecord &upnp = state.FindOrAdd(mNet.lanRouter, "upnp");
+  zark::portmap::RouterRecord &upnp =
+      state.FindOrAdd(mNet.lanRouter, zark::portmap::RouterProtocol::kUpnp);
   upnp.location = Elsewhere("/rootDesc.xml");
   zark::portmap::RecordedMapping old;
   old.protocol = zark::portmap::IpProtocol::kTcp;
@@ -274,7 +277,7 @@ TEST_F(SecurityRouterReplies, NatPmpSaveTalksToTheGatewayOnly) {
   old.ruleId = "9";
   upnp.Put(old);
   zark::portmap::RouterRecord &natpmp =
-      state.FindOrAdd(mNet.lanRouter, "natpmp");
+      state.FindOrAdd(mNet.lanRouter, zark::portmap::RouterProtocol::kNatPmp);
   natpmp.location = mNet.wanOutside;
   ASSERT_TRUE(
       zark::portmap::SaveMappingState(zark::portmap::kMappingStatePath, state));

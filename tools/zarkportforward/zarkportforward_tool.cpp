@@ -1,8 +1,8 @@
 #include "zarkportforward_tool.h"
 
+#include "catalog/mapping_state.h"
+#include "drivers/driver_choice.h"
 #include "libzarkportmap.h"
-#include "mapping_state.h"
-#include "router_driver.h"
 
 #include <memory>
 #include <vector>
@@ -114,7 +114,7 @@ int List(const std::string &gateway, std::ostream &out, std::ostream &err,
     err << "zarkportforward: the record of our mappings cannot be read\n";
   }
   const RouterRecord *record = state.Find(gateway, choice.protocol);
-  std::unique_ptr<RouterProtocol> router =
+  std::unique_ptr<RouterDriver> router =
       environment.apply.makeRouter(choice.protocol, gateway, record);
   if (router == nullptr) {
     return kToolRouterFailed;
@@ -125,7 +125,8 @@ int List(const std::string &gateway, std::ostream &out, std::ostream &err,
     return record != nullptr && record->Find(protocol, port) != nullptr;
   };
   if (listed.outcome == RouterOutcome::kUnsupported) {
-    out << "router: " << choice.protocol << " at " << gateway
+    out << "router: " << RouterProtocolName(choice.protocol) << " at "
+        << gateway
         << " (it cannot list its table; these are the mappings this server "
            "made)\n";
     if (record != nullptr) {
@@ -143,7 +144,8 @@ int List(const std::string &gateway, std::ostream &out, std::ostream &err,
     err << "zarkportforward: " << listed.message << "\n";
     return kToolRouterFailed;
   }
-  out << "router: " << choice.protocol << " at " << router->Location() << "\n";
+  out << "router: " << RouterProtocolName(choice.protocol) << " at "
+      << router->Location() << "\n";
   for (const RouterMapping &entry : entries) {
     out << (ours(entry.protocol, entry.externalPort) ? "* " : "  ")
         << UpnpProtocolName(entry.protocol) << " " << entry.externalPort

@@ -3,7 +3,7 @@
 #ifndef ZARK_TOOLS_ZARKPORTFORWARD_TOOL_H
 #define ZARK_TOOLS_ZARKPORTFORWARD_TOOL_H
 
-#include "save_rules.h"
+#include "apply/save_rules.h"
 
 #include <functional>
 #include <optional>

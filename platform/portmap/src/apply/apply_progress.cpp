@@ -1,0 +1,105 @@
+#include "apply/apply_progress.h"
+
+#include "base/portmap_log.h"
+#include "base/unique_fd.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <utility>
+
+namespace zark::portmap {
+namespace {
+
+bool WriteAll(int fd, std::string_view data) {
+  while (!data.empty()) {
+    ssize_t written = ::write(fd, data.data(), data.size());
+    if (written < 0) {
+      if (errno == EINTR) {
+        continue;
+      }
+      return false;
+    }
+    data.remove_prefix(static_cast<std::size_t>(written));
+  }
+  return true;
+}
+
+// Replaces path by a new file holding text: a temporary file beside it,
+// renamed over it. Not flushed to disk: progress is worth nothing after a
+// crash. rename() replaces a symlink at path rather than following it.
+bool ReplaceProgressFile(const std::string &path, std::string_view text) {
+  std::string temp = path + ".XXXXXX";
+  UniqueFd fd(::mkostemp(temp.data(), O_CLOEXEC));
+  if (!fd.Valid()) {
+    ZARK_PM_LOG_CALL("mkostemp", -1, errno, temp.c_str());
+    return false;
+  }
+  bool ok = ::fchmod(fd.Get(), 0644) == 0 && WriteAll(fd.Get(), text);
+  int savedErrno = errno;
+  if (::close(fd.Release()) != 0 && ok) {
+    ok = false;
+    savedErrno = errno;
+  }
+  if (!ok || ::rename(temp.c_str(), path.c_str()) != 0) {
+    if (ok) {
+      savedErrno = errno;
+    }
+    ZARK_PM_LOG_CALL("write progress", -1, savedErrno, path.c_str());
+    ::unlink(temp.c_str());
+    return false;
+  }
+  return true;
+}
+
+} // namespace
+
+int ProgressPercentage(std::string_view stage, int done, int total) {
+  int half = total <= 0 ? 50 : static_cast<int>(50LL * done / total);
+  if (half > 50) {
+    half = 50;
+  }
+  return stage == "add" ? 50 + half : half;
+}
+
+std::string ProgressLine(std::string_view stage, int done, int total) {
+  return std::string(stage) + "=" + std::to_string(done) + "/" +
+         std::to_string(total) + "\n";
+}
+
+ApplyProgress::ApplyProgress(std::string path,
+                             ZARK_SAVE_RULE_PROGRESS_CB callback, void *arg,
+                             ZARK_ROUTER_SAVE_RULE_RESULT *result)
+    : mPath(std::move(path)), mCallback(callback), mArg(arg), mResult(result) {}
+
+ApplyProgress::~ApplyProgress() {
+  if (mWrote && ::unlink(mPath.c_str()) != 0 && errno != ENOENT) {
+    ZARK_PM_LOG_CALL("unlink", -1, errno, mPath.c_str());
+  }
+}
+
+void ApplyProgress::Report(std::string_view stage, int done, int total) {
+  if (!mPath.empty() &&
+      ReplaceProgressFile(mPath, ProgressLine(stage, done, total))) {
+    mWrote = true;
+  }
+  Call(ProgressPercentage(stage, done, total));
+}
+
+void ApplyProgress::Finish() {
+  Call(100);
+}
+
+void ApplyProgress::Call(int percentage) {
+  if (mResult != nullptr) {
+    mResult->percentage = percentage;
+  }
+  if (mCallback != nullptr && mResult != nullptr) {
+    mCallback(mResult, mArg);
+  }
+}
+
+} // namespace zark::portmap

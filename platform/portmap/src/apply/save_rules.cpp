@@ -1,0 +1,694 @@
+#include "apply/save_rules.h"
+
+#include "RouterRuleConf.h"
+#include "apply/apply_progress.h"
+#include "base/local_network.h"
+#include "base/portmap_log.h"
+#include "catalog/router_conf_store.h"
+#include "rules/rule_validation.h"
+
+#include <syslog.h>
+
+#include <climits>
+#include <cstring>
+#include <ctime>
+#include <exception>
+#include <map>
+#include <set>
+#include <utility>
+#include <vector>
+
+namespace zark::portmap {
+namespace {
+
+using Clock = std::chrono::steady_clock;
+using Key = std::pair<IpProtocol, uint16_t>;
+
+std::string_view Field(const char (&field)[ZARK_PORTMAP_TEXT_SIZE]) {
+  return std::string_view(field, strnlen(field, ZARK_PORTMAP_TEXT_SIZE));
+}
+
+void CopyText(char (&to)[ZARK_PORTMAP_TEXT_SIZE], std::string_view text) {
+  std::size_t length = std::min(text.size(), sizeof(to) - 1);
+  std::memcpy(to, text.data(), length);
+  to[length] = '\0';
+}
+
+std::string PortText(IpProtocol protocol, uint16_t port) {
+  return std::string(ProtocolText(protocol)) + " " + std::to_string(port);
+}
+
+// One piece of router work.
+struct Step {
+  enum class Kind { kDelete, kAdd, kCheck };
+  Kind kind = Kind::kAdd;
+  PortMapping mapping;
+  std::string ruleId;
+  // The state's entry for the port before this job touched it; put back
+  // when the step is never attempted.
+  std::optional<RecordedMapping> before;
+  bool attempted = false;
+
+  [[nodiscard]] Key PortKey() const {
+    return {mapping.protocol, mapping.externalPort};
+  }
+};
+
+// Runs one job; see ApplyRules.
+class Applier {
+public:
+  Applier(std::string gateway, const ApplyOptions &options,
+          const ApplyEnvironment &environment,
+          ZARK_ROUTER_SAVE_RULE_RESULT &result,
+          ZARK_SAVE_RULE_PROGRESS_CB callback, void *arg)
+      : mGateway(std::move(gateway)), mOptions(options), mEnv(environment),
+        mResult(result),
+        mProgress(options.reportProgress ? environment.progressPath
+                                         : std::string(),
+                  callback, arg, &result),
+        mStart(Clock::now()) {}
+
+  int Run(std::span<const ZARK_ROUTER_RULE> rules, ApplySummary &summary);
+
+private:
+  // Records the first failure of the job (its type and text go to the
+  // result) and logs every one.
+  void Fail(uint32_t type, const std::string &message);
+  [[nodiscard]] bool Failed() const {
+    return mResult.errType != ZARK_SAVE_ERR_NONE;
+  }
+  [[nodiscard]] bool OutOfTime() const {
+    return Clock::now() - mStart >= mEnv.deadline;
+  }
+  [[nodiscard]] bool SaveState();
+  void Plan(const std::vector<WantedMapping> &wanted);
+  void MarkBeforeTouching();
+  void RunDeletions(RouterDriver &router);
+  void RunStaleDeletions();
+  void RunAdditions(RouterDriver &router);
+  void RecordAdded(const Step &step, const RouterResult &added);
+  void PutBackUnattempted();
+  [[nodiscard]] RouterRecord &Record() { return mState.routers[mRecordIndex]; }
+  [[nodiscard]] bool IsRouterGone(RouterOutcome outcome) const;
+
+  std::string mGateway;
+  const ApplyOptions &mOptions;
+  const ApplyEnvironment &mEnv;
+  ZARK_ROUTER_SAVE_RULE_RESULT &mResult;
+  ApplyProgress mProgress;
+  Clock::time_point mStart;
+  Clock::time_point mLastStateSave;
+
+  RouterProtocol mProtocol = RouterProtocol::kUpnp;
+  std::string mClient;
+  MappingState mState;
+  std::size_t mRecordIndex = 0;
+  std::vector<Step> mDeletions;
+  std::vector<Step> mAdditions;
+  std::set<Key> mWantedKeys;
+  std::vector<std::size_t> mStaleRecords; // other protocols, same gateway
+  int mStaleTotal = 0;
+  int mDeleteDone = 0;
+  bool mAborted = false;
+  ApplySummary *mSummary = nullptr;
+};
+
+void Applier::Fail(uint32_t type, const std::string &message) {
+  ZARK_PM_LOG_ERROR("applying rules to the router at %s: %s", mGateway.c_str(),
+                    message.c_str());
+  if (Failed()) {
+    return;
+  }
+  mResult.errType = type;
+  std::memset(&mResult.detail, 0, sizeof(mResult.detail));
+  CopyText(mResult.detail.text, message);
+}
+
+bool Applier::IsRouterGone(RouterOutcome outcome) const {
+  return outcome == RouterOutcome::kNoAnswer ||
+         outcome == RouterOutcome::kNoRouter ||
+         outcome == RouterOutcome::kFailed;
+}
+
+bool Applier::SaveState() {
+  mLastStateSave = Clock::now();
+  if (!SaveMappingState(mEnv.statePath, mState)) {
+    Fail(kSaveErrIo,
+         "cannot record the router's mappings in " + mEnv.statePath);
+    return false;
+  }
+  return true;
+}
+
+void Applier::Plan(const std::vector<WantedMapping> &wanted) {
+  RouterRecord &record = Record();
+  std::map<Key, const WantedMapping *> byKey;
+  for (const WantedMapping &want : wanted) {
+    byKey.emplace(Key{want.protocol, want.externalPort}, &want);
+    mWantedKeys.insert({want.protocol, want.externalPort});
+  }
+  for (const RecordedMapping &recorded : record.mappings) {
+    auto found = byKey.find({recorded.protocol, recorded.externalPort});
+    bool keep = found != byKey.end() &&
+                found->second->internalPort == recorded.internalPort &&
+                recorded.internalClient == mClient;
+    if (keep) {
+      continue;
+    }
+    Step step;
+    step.kind = Step::Kind::kDelete;
+    step.mapping = {recorded.protocol, recorded.externalPort,
+                    recorded.internalPort, recorded.internalClient,
+                    MappingDescription(recorded.ruleId)};
+    step.ruleId = recorded.ruleId;
+    step.before = recorded;
+    mDeletions.push_back(std::move(step));
+  }
+  const int64_t now = mEnv.now();
+  for (const WantedMapping &want : wanted) {
+    const RecordedMapping *recorded =
+        record.Find(want.protocol, want.externalPort);
+    Step step;
+    step.mapping = {want.protocol, want.externalPort, want.internalPort,
+                    mClient, MappingDescription(want.ruleId)};
+    step.ruleId = want.ruleId;
+    if (recorded != nullptr) {
+      step.before = *recorded;
+    }
+    bool same = recorded != nullptr && recorded->held &&
+                recorded->internalPort == want.internalPort &&
+                recorded->internalClient == mClient;
+    if (!same) {
+      step.kind = Step::Kind::kAdd;
+    } else if (mOptions.refreshLeases && recorded->expires != 0 &&
+               recorded->expires - now < mEnv.renewAhead.count()) {
+      step.kind = Step::Kind::kAdd;
+    } else if (mOptions.verifyUnchanged) {
+      step.kind = Step::Kind::kCheck;
+    } else {
+      ++mSummary->unchanged;
+      continue;
+    }
+    mAdditions.push_back(std::move(step));
+  }
+  for (std::size_t i = 0; i < mState.routers.size(); ++i) {
+    const RouterRecord &other = mState.routers[i];
+    if (i != mRecordIndex && other.gateway == mGateway &&
+        !other.mappings.empty()) {
+      mStaleRecords.push_back(i);
+      mStaleTotal += static_cast<int>(other.mappings.size());
+    }
+  }
+}
+
+void Applier::MarkBeforeTouching() {
+  RouterRecord &record = Record();
+  for (const Step &step : mDeletions) {
+    if (RecordedMapping *entry =
+            record.Find(step.mapping.protocol, step.mapping.externalPort)) {
+      entry->held = false;
+    }
+  }
+  for (const Step &step : mAdditions) {
+    if (step.kind == Step::Kind::kCheck) {
+      continue;
+    }
+    RecordedMapping entry;
+    entry.protocol = step.mapping.protocol;
+    entry.externalPort = step.mapping.externalPort;
+    entry.internalPort = step.mapping.internalPort;
+    entry.internalClient = step.mapping.internalClient;
+    entry.held = false;
+    entry.ruleId = step.ruleId;
+    if (step.before && step.before->held &&
+        step.before->internalPort == entry.internalPort &&
+        step.before->internalClient == entry.internalClient) {
+      // A lease being refreshed: the mapping is there until it runs out.
+      entry = *step.before;
+    }
+    record.Put(entry);
+  }
+}
+
+void Applier::RunDeletions(RouterDriver &router) {
+  const int total = static_cast<int>(mDeletions.size()) + mStaleTotal;
+  for (Step &step : mDeletions) {
+    if (mAborted) {
+      break;
+    }
+    if (OutOfTime()) {
+      Fail(kSaveErrRouter, "the job ran out of time after " +
+                               std::to_string(mEnv.deadline.count()) + " s");
+      mAborted = true;
+      break;
+    }
+    step.attempted = true;
+    ++mSummary->operations;
+    RouterResult deleted = router.DeletePortMapping(step.mapping);
+    const Key key = step.PortKey();
+    const bool alsoAdded = mWantedKeys.count(key) != 0;
+    // The add step of the same port, if any, puts back what the router
+    // holds there now should it never run.
+    Step *add = nullptr;
+    for (Step &candidate : mAdditions) {
+      if (candidate.PortKey() == key) {
+        add = &candidate;
+      }
+    }
+    if (deleted.Ok() || deleted.outcome == RouterOutcome::kNotFound) {
+      ++mSummary->deleted;
+      if (!alsoAdded) {
+        Record().Remove(key.first, key.second);
+      }
+      if (add != nullptr) {
+        add->before.reset();
+      }
+    } else if (IsRouterGone(deleted.outcome)) {
+      // Left "not known to be held": the next job deletes it again.
+      Fail(kSaveErrRouter, deleted.message);
+      mAborted = true;
+      if (add != nullptr && add->before) {
+        add->before->held = false;
+      }
+      break;
+    } else {
+      // The router kept it.
+      ++mSummary->failed;
+      RecordedMapping kept = *step.before;
+      kept.held = true;
+      if (!alsoAdded) {
+        Record().Put(kept);
+      }
+      if (add != nullptr) {
+        add->before = kept;
+      }
+      Fail(kSaveErrRouter, "deleting " + PortText(key.first, key.second) +
+                               ": " + deleted.message);
+    }
+    ++mDeleteDone;
+    mProgress.Report("del", mDeleteDone, total);
+  }
+}
+
+void Applier::RunStaleDeletions() {
+  const int total = static_cast<int>(mDeletions.size()) + mStaleTotal;
+  for (std::size_t index : mStaleRecords) {
+    if (mAborted) {
+      return;
+    }
+    RouterRecord &stale = mState.routers[index];
+    // Mappings made with the protocol this gateway used before: deleted
+    // through that protocol, as far as it still answers. Failing here does
+    // not fail the job; what is left stays recorded for the next one.
+    std::unique_ptr<RouterDriver> old =
+        mEnv.makeRouter(stale.protocol, mGateway, &stale);
+    std::vector<RecordedMapping> mappings = stale.mappings;
+    bool gone = old == nullptr;
+    for (const RecordedMapping &mapping : mappings) {
+      if (!gone && !OutOfTime()) {
+        ++mSummary->operations;
+        RouterResult deleted = old->DeletePortMapping(
+            {mapping.protocol, mapping.externalPort, mapping.internalPort,
+             mapping.internalClient, MappingDescription(mapping.ruleId)});
+        if (deleted.Ok() || deleted.outcome == RouterOutcome::kNotFound) {
+          ++mSummary->deleted;
+          stale.Remove(mapping.protocol, mapping.externalPort);
+        } else {
+          ZARK_PM_LOG_ERROR(
+              "cannot delete %s made by %s before: %s",
+              PortText(mapping.protocol, mapping.externalPort).c_str(),
+              std::string(RouterProtocolName(stale.protocol)).c_str(),
+              deleted.message.c_str());
+          gone = IsRouterGone(deleted.outcome);
+        }
+      }
+      ++mDeleteDone;
+      mProgress.Report("del", mDeleteDone, total);
+    }
+  }
+}
+
+void Applier::RecordAdded(const Step &step, const RouterResult &added) {
+  RecordedMapping entry;
+  entry.protocol = step.mapping.protocol;
+  entry.externalPort = step.mapping.externalPort;
+  entry.internalPort = step.mapping.internalPort;
+  entry.internalClient = step.mapping.internalClient;
+  entry.leaseSeconds = added.leaseSeconds;
+  entry.expires = added.leaseSeconds == 0
+                      ? 0
+                      : mEnv.now() + static_cast<int64_t>(added.leaseSeconds);
+  entry.held = true;
+  entry.ruleId = step.ruleId;
+  Record().Put(entry);
+}
+
+void Applier::RunAdditions(RouterDriver &router) {
+  const int total = static_cast<int>(mAdditions.size());
+  int done = 0;
+  for (Step &step : mAdditions) {
+    if (mAborted) {
+      break;
+    }
+    if (OutOfTime()) {
+      Fail(kSaveErrRouter, "the job ran out of time after " +
+                               std::to_string(mEnv.deadline.count()) + " s");
+      mAborted = true;
+      break;
+    }
+    step.attempted = true;
+    const Key key = step.PortKey();
+    const std::string where = "rule \"" + step.ruleId + "\", router port " +
+                              PortText(key.first, key.second);
+    bool add = true;
+    if (step.kind == Step::Kind::kCheck) {
+      ++mSummary->operations;
+      RouterMapping entry;
+      RouterResult checked =
+          router.GetSpecificPortMapping(key.first, key.second, entry);
+      if (checked.Ok()) {
+        ++mSummary->checked;
+        if (entry.internalClient == step.mapping.internalClient &&
+            entry.internalPort == step.mapping.internalPort) {
+          RouterResult held;
+          held.outcome = RouterOutcome::kOk;
+          held.leaseSeconds = entry.leaseSeconds;
+          RecordAdded(step, held);
+          add = false;
+        } else {
+          ++mSummary->failed;
+          Record().Remove(key.first, key.second);
+          Fail(kSaveErrRouter, where + " now goes to " + entry.internalClient +
+                                   ":" + std::to_string(entry.internalPort) +
+                                   " on the router");
+          add = false;
+        }
+      } else if (IsRouterGone(checked.outcome)) {
+        Fail(kSaveErrRouter, checked.message);
+        mAborted = true;
+        break;
+      }
+      // Not found, not understood, or not askable (NAT-PMP): add it again;
+      // until the router answers, it is not known to be there.
+      if (add) {
+        if (RecordedMapping *recorded = Record().Find(key.first, key.second)) {
+          recorded->held = false;
+        }
+      }
+    }
+    if (add) {
+      ++mSummary->operations;
+      RouterResult added = router.AddPortMapping(step.mapping);
+      switch (added.outcome) {
+      case RouterOutcome::kOk:
+        ++mSummary->added;
+        RecordAdded(step, added);
+        break;
+      case RouterOutcome::kConflict: {
+        ++mSummary->failed;
+        Record().Remove(key.first, key.second);
+        Fail(kSaveErrRouter,
+             where + " is taken on the router: " + added.message);
+        // NAT-PMP granted another port: give it back unless it is one of
+        // ours.
+        uint16_t granted = added.grantedExternalPort;
+        if (granted != 0 && mWantedKeys.count({key.first, granted}) == 0 &&
+            Record().Find(key.first, granted) == nullptr) {
+          PortMapping extra = step.mapping;
+          extra.externalPort = granted;
+          ++mSummary->operations;
+          RouterResult returned = router.DeletePortMapping(extra);
+          if (!returned.Ok()) {
+            ZARK_PM_LOG_ERROR("cannot give back %s: %s",
+                              PortText(key.first, granted).c_str(),
+                              returned.message.c_str());
+          }
+        }
+        break;
+      }
+      case RouterOutcome::kNotHeld:
+        // The router's table is full: further adds would be dropped too.
+        ++mSummary->failed;
+        Record().Remove(key.first, key.second);
+        Fail(kSaveErrRouter, where + ": " + added.message);
+        mAborted = true;
+        break;
+      case RouterOutcome::kRefused:
+      case RouterOutcome::kNotFound:
+      case RouterOutcome::kUnsupported:
+        ++mSummary->failed;
+        Record().Remove(key.first, key.second);
+        Fail(kSaveErrRouter, where + ": " + added.message);
+        break;
+      case RouterOutcome::kBadReply:
+        // It may or may not be there: stays "not known to be held".
+        ++mSummary->failed;
+        Fail(kSaveErrRouter, where + ": " + added.message);
+        break;
+      case RouterOutcome::kNoAnswer:
+      case RouterOutcome::kNoRouter:
+      case RouterOutcome::kFailed:
+        Fail(kSaveErrRouter, where + ": " + added.message);
+        mAborted = true;
+        break;
+      }
+    }
+    ++done;
+    mProgress.Report("add", done, total);
+    if (!mAborted && Clock::now() - mLastStateSave >= mEnv.stateSaveInterval &&
+        !SaveMappingState(mEnv.statePath, mState)) {
+      // Logged; the final write below decides the result.
+      mLastStateSave = Clock::now();
+    }
+  }
+}
+
+void Applier::PutBackUnattempted() {
+  RouterRecord &record = Record();
+  for (std::vector<Step> *steps : {&mDeletions, &mAdditions}) {
+    for (const Step &step : *steps) {
+      if (step.attempted || step.kind == Step::Kind::kCheck) {
+        continue;
+      }
+      if (step.before) {
+        record.Put(*step.before);
+      } else {
+        record.Remove(step.mapping.protocol, step.mapping.externalPort);
+      }
+    }
+  }
+}
+
+int Applier::Run(std::span<const ZARK_ROUTER_RULE> rules,
+                 ApplySummary &summary) {
+  mSummary = &summary;
+  mResult = ZARK_ROUTER_SAVE_RULE_RESULT{};
+
+  std::optional<std::string> canonical = CanonicalGatewayAddress(mGateway);
+  if (!canonical) {
+    Fail(kSaveErrBadParameter,
+         "\"" + mGateway + "\" is not an IPv4 gateway address");
+    return -1;
+  }
+  mGateway = *canonical;
+
+  // The rule texts first: nothing else is looked at for a refused set.
+  std::vector<WantedMapping> wanted;
+  RuleRefusal refusal = PlanWantedMappings(rules, INT_MAX, wanted);
+  RouterChoice choice;
+  if (refusal.errType == ZARK_SAVE_ERR_NONE) {
+    int err = ZARK_PORTMAP_ERR_NONE;
+    if (!mEnv.chooseRouter(mGateway, choice, err)) {
+      if (err == ZARK_PORTMAP_ERR_NOT_CONFIGURED) {
+        Fail(ZARK_SAVE_ERR_NOT_CONFIGURED,
+             "no router that the library can drive is configured for " +
+                 mGateway);
+      } else {
+        Fail(err == ZARK_PORTMAP_ERR_IO ? kSaveErrIo : kSaveErrGeneric,
+             "cannot read the router configuration of " + mGateway);
+      }
+      return -1;
+    }
+    refusal = PlanWantedMappings(rules, choice.maxRouterEntries, wanted);
+  }
+  if (refusal.errType != ZARK_SAVE_ERR_NONE) {
+    ZARK_PM_LOG_ERROR("rules refused: %s", refusal.reason.c_str());
+    mResult.errType = refusal.errType;
+    if (refusal.errType == ZARK_SAVE_ERR_BAD_PORT_TEXT ||
+        refusal.errType == ZARK_SAVE_ERR_BAD_PROTOCOL) {
+      CopyText(mResult.detail.text, refusal.text);
+    } else {
+      mResult.detail.limit.maxPort = refusal.maxPort;
+      mResult.detail.limit.maxRange = refusal.maxRange;
+    }
+    return -1;
+  }
+  mProtocol = choice.protocol;
+
+  // The rule configuration to write on success, built now so that a text
+  // that does not fit stops the job before the router is touched.
+  RouterRuleConfWriter writer;
+  for (const ZARK_ROUTER_RULE &rule : rules) {
+    if (!writer.AddRule(std::string(Field(rule.rule_id)), rule.enable != 0,
+                        std::string(Field(rule.router_port)),
+                        std::string(Field(rule.ds_port)),
+                        std::string(Field(rule.router_protocol)),
+                        std::string(Field(rule.serviceid)),
+                        std::string(Field(rule.service_name)))) {
+      Fail(kSaveErrBadParameter, "a rule text does not fit the rule store");
+      return -1;
+    }
+  }
+
+  std::optional<std::string> client = mEnv.localAddress(mGateway);
+  if (!client) {
+    Fail(kSaveErrRouter, "no route to the gateway " + mGateway);
+    return -1;
+  }
+  mClient = *client;
+
+  RunningTaskMark mark(ZARK_PORTMAP_TASK_APPLY_RULES, mEnv.runningTaskPath);
+
+  if (!LoadMappingState(mEnv.statePath, mState)) {
+    ZARK_PM_LOG_ERROR("the mappings made before are unknown; starting from "
+                      "none");
+  }
+  mState.FindOrAdd(mGateway, mProtocol);
+  for (std::size_t i = 0; i < mState.routers.size(); ++i) {
+    if (mState.routers[i].gateway == mGateway &&
+        mState.routers[i].protocol == mProtocol) {
+      mRecordIndex = i;
+    }
+  }
+  Plan(wanted);
+
+  const int deleteTotal = static_cast<int>(mDeletions.size()) + mStaleTotal;
+  const int addTotal = static_cast<int>(mAdditions.size());
+  mProgress.Report("del", 0, deleteTotal);
+  syslog(LOG_INFO,
+         "%s:%d applying rules to the %s router at %s: %d to delete, %d to "
+         "add or check, %d unchanged",
+         __FILE__, __LINE__, std::string(RouterProtocolName(mProtocol)).c_str(),
+         mGateway.c_str(), deleteTotal, addTotal, summary.unchanged);
+
+  if (deleteTotal + addTotal > 0) {
+    MarkBeforeTouching();
+    if (!SaveState()) {
+      return -1;
+    }
+    std::unique_ptr<RouterDriver> router =
+        mEnv.makeRouter(mProtocol, mGateway, &Record());
+    if (router == nullptr) {
+      Fail(kSaveErrGeneric, "no driver for protocol " +
+                                std::string(RouterProtocolName(mProtocol)));
+      PutBackUnattempted();
+      (void)SaveMappingState(mEnv.statePath, mState);
+      return -1;
+    }
+    RunDeletions(*router);
+    RunStaleDeletions();
+    if (!mDeletions.empty() || mStaleTotal > 0) {
+      (void)SaveMappingState(mEnv.statePath, mState);
+      mLastStateSave = Clock::now();
+    }
+    mProgress.Report("add", 0, addTotal);
+    RunAdditions(*router);
+    PutBackUnattempted();
+    std::string location = router->Location();
+    if (!location.empty()) {
+      Record().location = location;
+      Record().finiteLeases = router->FiniteLeases();
+    }
+    mState.DropEmpty();
+    if (!SaveMappingState(mEnv.statePath, mState)) {
+      Fail(kSaveErrIo,
+           "cannot record the router's mappings in " + mEnv.statePath);
+    }
+  } else {
+    mProgress.Report("add", 0, 0);
+  }
+
+  if (Failed()) {
+    return -1;
+  }
+  if (mOptions.writeRuleConf && !writer.Sync(mEnv.ruleConfPath)) {
+    Fail(kSaveErrIo, "the router holds the rules but " + mEnv.ruleConfPath +
+                         " cannot be written");
+    return -1;
+  }
+  mProgress.Finish();
+  return 0;
+}
+
+} // namespace
+
+std::string MappingDescription(std::string_view ruleId) {
+  std::string description = "zarkportforward ";
+  std::size_t length = std::min<std::size_t>(ruleId.size(), 40);
+  for (std::size_t i = 0; i < length; ++i) {
+    char c = ruleId[i];
+    bool plain = (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') ||
+                 (c >= '0' && c <= '9') || c == '.' || c == '-' || c == '_';
+    description += plain ? c : '_';
+  }
+  return description;
+}
+
+ApplyEnvironment DefaultApplyEnvironment() {
+  ApplyEnvironment environment;
+  environment.chooseRouter = ChooseRouter;
+  environment.makeRouter = MakeRouter;
+  environment.localAddress = [](const std::string &gateway) {
+    return LocalAddressTowards(gateway);
+  };
+  environment.now = [] { return static_cast<int64_t>(std::time(nullptr)); };
+  return environment;
+}
+
+int ApplyRules(const std::string &gateway,
+               std::span<const ZARK_ROUTER_RULE> rules,
+               const ApplyOptions &options, const ApplyEnvironment &environment,
+               ZARK_ROUTER_SAVE_RULE_RESULT &result,
+               ZARK_SAVE_RULE_PROGRESS_CB callback, void *arg,
+               ApplySummary *summary) {
+  // Where the summary goes when the caller does not want it.
+  // cppcheck-suppress unassignedVariable
+  ApplySummary local;
+  Applier applier(gateway, options, environment, result, callback, arg);
+  return applier.Run(rules, summary != nullptr ? *summary : local);
+}
+
+} // namespace zark::portmap
+
+extern "C" int KLibSaveRules(const char *gatewayIP, int count,
+                             ZARK_ROUTER_RULE *rules, bool flag,
+                             ZARK_ROUTER_SAVE_RULE_RESULT *result,
+                             ZARK_SAVE_RULE_PROGRESS_CB callback, void *arg) {
+  using namespace zark::portmap;
+  ZARK_ROUTER_SAVE_RULE_RESULT local{};
+  ZARK_ROUTER_SAVE_RULE_RESULT &out = result != nullptr ? *result : local;
+  if (gatewayIP == nullptr || count < 0 || (count > 0 && rules == nullptr)) {
+    ZARK_PM_LOG_ERROR("KLibSaveRules: bad arguments (gateway %s, count %d, "
+                      "rules %s)",
+                      gatewayIP != nullptr ? "given" : "NULL", count,
+                      rules != nullptr ? "given" : "NULL");
+    out = ZARK_ROUTER_SAVE_RULE_RESULT{};
+    out.errType = kSaveErrBadParameter;
+    return -1;
+  }
+  try {
+    ApplyOptions options;
+    // flag: also check the mappings the library believes unchanged.
+    options.verifyUnchanged = flag;
+    ApplyEnvironment environment = DefaultApplyEnvironment();
+    return ApplyRules(gatewayIP,
+                      std::span<const ZARK_ROUTER_RULE>(
+                          rules, static_cast<std::size_t>(count)),
+                      options, environment, out, callback, arg);
+  } catch (const std::exception &e) {
+    // Nothing may cross the C boundary.
+    ZARK_PM_LOG_ERROR("KLibSaveRules: %s", e.what());
+    out.errType = kSaveErrGeneric;
+    return -1;
+  }
+}

@@ -1,0 +1,399 @@
+#include "detect/detect_router.h"
+
+#include "base/conf_file.h"
+#include "base/detect_log.h"
+#include "base/ipv4_class.h"
+#include "base/library_config.h"
+#include "base/portmap_log.h"
+#include "base/unique_fd.h"
+#include "catalog/detect_result_store.h"
+#include "catalog/router_conf_store.h"
+#include "catalog/router_db.h"
+
+#include <fcntl.h>
+#include <sys/file.h>
+#include <syslog.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <exception>
+#include <mutex>
+
+namespace zark::portmap {
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+// The resolv.conf of a machine is a few lines.
+constexpr std::size_t kMaxResolvConfBytes = 64 * 1024;
+
+std::mutex gFactoryMutex;
+std::function<DetectEnvironment()> gFactory;
+
+void CopyText(char (&field)[ZARK_PORTMAP_TEXT_SIZE], std::string_view text) {
+  std::memset(field, 0, sizeof(field));
+  const std::size_t length = std::min(text.size(), sizeof(field) - 1);
+  std::memcpy(field, text.data(), length);
+}
+
+std::string Field(const char (&field)[ZARK_PORTMAP_TEXT_SIZE]) {
+  return std::string(field, ::strnlen(field, ZARK_PORTMAP_TEXT_SIZE));
+}
+
+std::string NameOf(std::string_view brand, std::string_view model,
+                   std::string_view version) {
+  if (brand.empty() || model.empty()) {
+    return {};
+  }
+  std::string name = std::string(brand) + ": " + std::string(model);
+  if (!version.empty()) {
+    name += "(" + std::string(version) + ")";
+  }
+  return name;
+}
+
+// One run: announces stages, times and logs the checks.
+class Run {
+public:
+  Run(ZARK_ROUTER_DETECT_RESULT &record, ZARK_DETECT_PROGRESS_CB callback,
+      void *arg, DetectEnvironment &environment)
+      : mRecord(record), mCallback(callback), mArg(arg), mEnv(environment) {}
+
+  int Execute() {
+    // 20: the interface.
+    Begin(ZARK_DETECT_STAGE_INTERFACE);
+    std::optional<std::string> routeTable = mEnv.network->RouteTable();
+    std::optional<std::vector<InterfaceInfo>> interfaces =
+        mEnv.network->Interfaces();
+    if (!interfaces) {
+      return Stop("interface", "the network interfaces cannot be listed");
+    }
+    const std::vector<DefaultRoute> routes =
+        routeTable ? ParseDefaultRoutes(*routeTable)
+                   : std::vector<DefaultRoute>{};
+    InterfaceCheck interface = CheckInterface(routes, *interfaces);
+    CopyText(mRecord.network_interface, interface.interface);
+    if (!interface.ok) {
+      return Stop("interface", interface.why);
+    }
+    Passed("interface", interface.why);
+
+    // 30: the gateway.
+    Begin(ZARK_DETECT_STAGE_GATEWAY);
+    if (!routeTable) {
+      return Stop("gateway", "the routing table cannot be read");
+    }
+    GatewayCheck gateway = CheckGateway(routes, *interfaces);
+    if (!gateway.ok) {
+      return Stop("gateway", gateway.why);
+    }
+    const std::string gatewayText = FormatIpv4(gateway.gateway);
+    CopyText(mRecord.gateway_ip, gatewayText);
+    if (gateway.warning) {
+      mRecord.warning |= ZARK_DETECT_WARN_GATEWAY;
+      ZARK_DETECT_WARNING("detection: the gateway setting looks wrong: %s",
+                          gateway.why.c_str());
+    }
+    Passed("gateway", gateway.why);
+
+    // 40: the WAN.
+    Begin(ZARK_DETECT_STAGE_WAN);
+    const std::vector<WanProbeHost> hosts = ParseWanProbeHosts(
+        mEnv.config(config_key::kWanProbeHosts, kDefaultWanProbeHosts));
+    NameResolver resolve = [this](std::string_view name,
+                                  std::chrono::milliseconds budget) {
+      std::optional<std::string> text = mEnv.resolvConf();
+      const std::vector<std::string> servers =
+          text ? ParseResolvConf(*text) : std::vector<std::string>{};
+      DnsLookup lookup = mEnv.dns->Lookup(servers, name, budget);
+      return lookup.outcome == DnsOutcome::kAnswered ? lookup.addresses
+                                                     : std::vector<uint32_t>{};
+    };
+    WanCheck wan =
+        CheckWan(hosts, resolve, *mEnv.connector, mEnv.limits.wanBudget);
+    if (!wan.ok) {
+      return Stop("WAN", wan.why);
+    }
+    Passed("WAN", wan.why);
+
+    // 70: the hops to the first public address. Never stops the run.
+    Begin(ZARK_DETECT_STAGE_HOPS);
+    const std::vector<HopReply> replies =
+        mEnv.hopProber->Probe(wan.reached.address, mEnv.limits.hops);
+    HopsFinding hops = InterpretHops(replies, mEnv.limits.hops.maxTtl);
+    if (!hops.known) {
+      mRecord.hops = 0;
+      mRecord.warning |= ZARK_DETECT_WARN_HOPS_UNKNOWN;
+      ZARK_DETECT_WARNING("detection: the hop count towards %s is unknown: "
+                          "%s (path %s)",
+                          FormatIpv4(wan.reached.address).c_str(),
+                          hops.why.c_str(), hops.path.c_str());
+    } else {
+      mRecord.hops = hops.hops;
+      if (hops.hops > 1) {
+        mRecord.warning |= ZARK_DETECT_WARN_HOPS_OVER_ONE;
+        ZARK_DETECT_WARNING(
+            "detection: %d private hops before the internet (path %s): %s",
+            hops.hops, hops.path.c_str(),
+            hops.carrierGradeNat
+                ? "the carrier puts this network behind its own NAT "
+                  "(carrier-grade NAT, 100.64.0.0/10)"
+                : "a router behind a router");
+      }
+    }
+    Passed("hops", hops.why + " (path " + hops.path + ")");
+
+    // 50: DNS.
+    Begin(ZARK_DETECT_STAGE_DNS);
+    const std::string name =
+        mEnv.config(config_key::kDnsProbeName, kDefaultDnsProbeName);
+    DnsCheck dns =
+        CheckDns(mEnv.resolvConf(), name, *mEnv.dns, mEnv.limits.dnsBudget);
+    if (!dns.ok) {
+      return Stop("DNS", dns.why);
+    }
+    Passed("DNS", dns.why);
+
+    // 80: the router.
+    Begin(ZARK_DETECT_STAGE_ROUTER);
+    RouterFindings findings = ProbeRouter(*mEnv.router, gatewayText);
+    RouterCheck router = CheckRouter(findings);
+    mRecord.support_upnp = static_cast<int32_t>(router.upnp);
+    mRecord.support_natpmp = static_cast<int32_t>(router.natpmp);
+    CopyText(mRecord.router_brand, router.name.brand);
+    CopyText(mRecord.router_model, router.name.model);
+    CopyText(mRecord.router_version, router.name.version);
+    CopyText(mRecord.upnp_pfpath, router.name.pfpath);
+    CopyText(mRecord.router_user_setting_name,
+             mEnv.userSettingName(gatewayText));
+    mRecord.router_max_rule =
+        router.name.pfpath.empty() ? 0 : mEnv.maxRules(router.name);
+    if (router.doubleNat) {
+      mRecord.warning |= kDetectWarnDoubleNat | ZARK_DETECT_WARN_HOPS_OVER_ONE;
+      ZARK_DETECT_WARNING(
+          "detection: double NAT: the router's outside address %s is %s; "
+          "ports it forwards are not reachable from the internet",
+          FormatIpv4(*router.outsideAddress).c_str(),
+          ClassifyIpv4(*router.outsideAddress) == Ipv4Class::kSharedCgn
+              ? "carrier-grade NAT space (100.64.0.0/10)"
+              : "a private address (RFC 1918)");
+    }
+    if (!router.ok) {
+      return Stop("router", router.why);
+    }
+    Passed("router", router.why + ", name \"" + router.name.pfpath +
+                         "\", max rules " +
+                         std::to_string(mRecord.router_max_rule));
+
+    Begin(ZARK_DETECT_STAGE_DONE);
+    return 0;
+  }
+
+private:
+  void Begin(int32_t stage) {
+    mRecord.enProgress = stage;
+    mStarted = mEnv.now();
+    if (mCallback != nullptr) {
+      mCallback(&mRecord, mArg);
+    }
+  }
+
+  long long Elapsed() const {
+    return std::chrono::duration_cast<std::chrono::milliseconds>(mEnv.now() -
+                                                                 mStarted)
+        .count();
+  }
+
+  void Passed(const char *check, const std::string &why) {
+    ZARK_DETECT_INFO("detection: %s check passed in %lld ms: %s", check,
+                     Elapsed(), why.c_str());
+  }
+
+  int Stop(const char *check, const std::string &why) {
+    ZARK_PM_LOG_ERROR("detection stopped at the %s check (stage %d) after "
+                      "%lld ms: %s",
+                      check, mRecord.enProgress, Elapsed(), why.c_str());
+    return -1;
+  }
+
+  ZARK_ROUTER_DETECT_RESULT &mRecord;
+  ZARK_DETECT_PROGRESS_CB mCallback;
+  void *mArg;
+  DetectEnvironment &mEnv;
+  Clock::time_point mStarted;
+};
+
+int32_t MaxRulesFromDatabase(const RouterName &name) {
+  RouterDbEntry entry;
+  int err = ZARK_PORTMAP_ERR_NONE;
+  if (FindRouterDbEntry(name.brand, name.model, name.version, entry, err)) {
+    return entry.maxRules;
+  }
+  if (err != ZARK_PORTMAP_ERR_NOT_CONFIGURED) {
+    return 0; // the database cannot be read; logged by the reader
+  }
+  RouterDb db;
+  if (!ReadRouterDb(db, err)) {
+    return 0;
+  }
+  for (const RouterDbEntry &candidate : db.entries) {
+    if (candidate.generic && candidate.brand == name.brand &&
+        candidate.model == name.model) {
+      return candidate.maxRules;
+    }
+  }
+  return 0;
+}
+
+std::string StoredSettingName(const std::string &gateway) {
+  ZARK_ROUTER_CONF conf{};
+  int err = ZARK_PORTMAP_ERR_NONE;
+  if (!LoadRouterConfForGateway(gateway, conf, err)) {
+    return {};
+  }
+  return NameOf(Field(conf.brand), Field(conf.model), Field(conf.version));
+}
+
+// Holds the detection lock (flock on kDetectLockPath) for its lifetime.
+class DetectionLock {
+public:
+  DetectionLock() {
+    if (!MakeFolders(ZARK_PORTMAP_CONF_DIR, 0755)) {
+      return;
+    }
+    mFd.Reset(::open(kDetectLockPath, O_RDWR | O_CREAT | O_CLOEXEC, 0600));
+    if (!mFd.Valid()) {
+      ZARK_PM_LOG_CALL("open", -1, errno, kDetectLockPath);
+      return;
+    }
+    if (::flock(mFd.Get(), LOCK_EX | LOCK_NB) != 0) {
+      if (errno == EWOULDBLOCK) {
+        ZARK_PM_LOG_ERROR("another router detection is running");
+      } else {
+        ZARK_PM_LOG_CALL("flock", -1, errno, kDetectLockPath);
+      }
+      mFd.Reset();
+    }
+  }
+  [[nodiscard]] bool Held() const { return mFd.Valid(); }
+
+private:
+  UniqueFd mFd; // closing it releases the lock
+};
+
+} // namespace
+
+DetectEnvironment MakeSystemDetectEnvironment() {
+  DetectEnvironment environment;
+  environment.network = MakeSystemNetworkInfo();
+  environment.connector = MakeSystemTcpConnector();
+  environment.hopProber = MakeUdpHopProber();
+  environment.dns = MakeUdpDnsClient();
+  environment.router = MakeRouterProbes(RouterProbeOptions{});
+  environment.config = [](std::string_view key, std::string_view fallback) {
+    return GetLibraryConfig(key, fallback);
+  };
+  environment.resolvConf = []() -> std::optional<std::string> {
+    ReadResult read = ReadSmallFile(kResolvConfPath, kMaxResolvConfBytes);
+    if (read.status == ReadStatus::kRead) {
+      return std::move(read.content);
+    }
+    return std::nullopt;
+  };
+  environment.maxRules = MaxRulesFromDatabase;
+  environment.userSettingName = StoredSettingName;
+  environment.now = [] { return Clock::now(); };
+  return environment;
+}
+
+int RunDetection(ZARK_ROUTER_DETECT_RESULT &record,
+                 ZARK_DETECT_PROGRESS_CB callback, void *arg,
+                 DetectEnvironment &environment) {
+  Run run(record, callback, arg, environment);
+  return run.Execute();
+}
+
+void SetDetectEnvironmentFactoryForTesting(
+    std::function<DetectEnvironment()> factory) {
+  std::lock_guard<std::mutex> lock(gFactoryMutex);
+  gFactory = std::move(factory);
+}
+
+} // namespace zark::portmap
+
+extern "C" {
+
+// flag true: the final record (of a complete run or of one stopped at a
+// check) is kept for KLibGetRouterDetectResult; false: it is only
+// returned. A run that cannot start (stage 10: no record, another
+// detection running, no lock file) keeps nothing.
+int KLibDetectRouter(ZARK_ROUTER_DETECT_RESULT *result,
+                     ZARK_DETECT_PROGRESS_CB callback, void *arg, bool flag) {
+  using namespace zark::portmap;
+  if (result == nullptr) {
+    ZARK_PM_LOG_ERROR("KLibDetectRouter: result must not be NULL");
+    return -1;
+  }
+  try {
+    *result = ZARK_ROUTER_DETECT_RESULT{};
+    result->enProgress = ZARK_DETECT_STAGE_START;
+    if (callback != nullptr) {
+      callback(result, arg);
+    }
+    DetectionLock lock;
+    if (!lock.Held()) {
+      ZARK_PM_LOG_ERROR("KLibDetectRouter: detection could not start");
+      return -1;
+    }
+    std::function<DetectEnvironment()> factory;
+    {
+      std::lock_guard<std::mutex> guard(gFactoryMutex);
+      factory = gFactory;
+    }
+    DetectEnvironment environment =
+        factory ? factory() : MakeSystemDetectEnvironment();
+    const int rc = RunDetection(*result, callback, arg, environment);
+    if (flag && !StoreDetectResult(kDetectResultPath, *result)) {
+      ZARK_PM_LOG_ERROR("KLibDetectRouter: the result could not be kept; "
+                        "KLibGetRouterDetectResult answers the previous one");
+    }
+    return rc;
+  } catch (const std::exception &e) {
+    ZARK_PM_LOG_ERROR("KLibDetectRouter: stopped at stage %d: %s",
+                      result->enProgress, e.what());
+    return -1;
+  }
+}
+
+int KLibGetRouterDetectResult(ZARK_ROUTER_DETECT_RESULT *result) {
+  using namespace zark::portmap;
+  if (result == nullptr) {
+    ZARK_PM_LOG_ERROR("KLibGetRouterDetectResult: result must not be NULL");
+    return -1;
+  }
+  try {
+    ZARK_ROUTER_DETECT_RESULT loaded{};
+    switch (LoadDetectResult(kDetectResultPath, loaded)) {
+    case DetectResultLoad::kLoaded:
+      *result = loaded;
+      return 0;
+    case DetectResultLoad::kNone:
+      // Nothing detected yet is an answer, not a failure: an empty record
+      // (no router found), so that a router can be configured by hand
+      // before any detection has run.
+      *result = ZARK_ROUTER_DETECT_RESULT{};
+      syslog(LOG_INFO, "KLibGetRouterDetectResult: no router detection has "
+                       "been run yet, answering an empty result");
+      return 0;
+    case DetectResultLoad::kBroken:
+      return -1;
+    }
+    return -1;
+  } catch (const std::exception &e) {
+    ZARK_PM_LOG_ERROR("KLibGetRouterDetectResult: %s", e.what());
+    return -1;
+  }
+}
+
+} // extern "C"
