@@ -12,7 +12,7 @@
 //            refused with result 2.
 //
 // Besides not crashing or hanging, every operation keeps the interface's
-// promises (router_protocol.h, natpmp.h):
+// promises (drivers/router_driver.h, natpmp.h):
 // - its outcome is one the operation documents;
 // - an add answered kOk holds the port asked for with a lease above 0; an
 //   add answered kConflict names the other port the router granted;

@@ -17,7 +17,7 @@
 // without answering.
 //
 // Besides not crashing or hanging, every operation keeps the interface's
-// promises (router_protocol.h):
+// promises (drivers/router_driver.h):
 // - its outcome is one the operation documents;
 // - Open uses a control URL on the local network (here: the gateway
 //   127.0.0.1 or 192.168.77.0/24), never another host a description names;
@@ -84,7 +84,7 @@ bool OneOf(RouterOutcome outcome, std::initializer_list<RouterOutcome> set) {
 
 // TODO(platform/portmap): Classify in upnp.cpp turns a router's 714 into
 // kNotFound and 718/729 into kConflict whatever the action, so any
-// operation can answer them, also where router_protocol.h does not list
+// operation can answer them, also where drivers/router_driver.h does not list
 // them (an add answering kNotFound, an external address kNotFound or
 // kConflict, ...); save_rules.cpp treats both as a refusal. Allowed here
 // until the interface lists them or the driver maps them per action; then

@@ -3,7 +3,7 @@
 //
 // 1. The rules are checked (rule_validation.h) before anything else; a
 //    refusal touches nothing.
-// 2. The router configuration picks the protocol (router_driver.h).
+// 2. The router configuration picks the protocol (drivers/driver_choice.h).
 // 3. The work is the difference between the mappings the rules ask for and
 //    those the library remembers having made on that router
 //    (mapping_state.h): mappings no longer wanted, or changed, are deleted

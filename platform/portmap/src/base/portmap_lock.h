@@ -1,7 +1,7 @@
 // Test seams of the system-wide port-map lock (KLibZarkPortMapLock). Not
 // for production callers.
-#ifndef ZARK_PORTMAP_PORTMAP_LOCK_INTERNAL_H
-#define ZARK_PORTMAP_PORTMAP_LOCK_INTERNAL_H
+#ifndef ZARK_PORTMAP_BASE_PORTMAP_LOCK_H
+#define ZARK_PORTMAP_BASE_PORTMAP_LOCK_H
 
 #include <chrono>
 #include <functional>

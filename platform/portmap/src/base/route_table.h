@@ -1,6 +1,6 @@
 // Finding the default IPv4 gateway in the kernel's routing table.
-#ifndef ZARK_PORTMAP_GATEWAY_ROUTE_H
-#define ZARK_PORTMAP_GATEWAY_ROUTE_H
+#ifndef ZARK_PORTMAP_BASE_ROUTE_TABLE_H
+#define ZARK_PORTMAP_BASE_ROUTE_TABLE_H
 
 #include <cstdint>
 #include <optional>

@@ -4,7 +4,7 @@
 #include "base/library_config.h"
 #include "base/portmap_log.h"
 #include "base/strict_json.h"
-#include "compat/compatibility_test.h"
+#include "compat/compatibility_files.h"
 #include "net/http_download.h"
 
 #include <httplib.h>

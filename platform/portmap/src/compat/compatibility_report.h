@@ -18,8 +18,8 @@
 //    "root_description_error": "..."}               (upload, when none)
 //
 // The router's account and password are never part of it.
-#ifndef ZARK_PORTMAP_UPNP_TEST_REPORT_H
-#define ZARK_PORTMAP_UPNP_TEST_REPORT_H
+#ifndef ZARK_PORTMAP_COMPAT_COMPATIBILITY_REPORT_H
+#define ZARK_PORTMAP_COMPAT_COMPATIBILITY_REPORT_H
 
 #include "libzarkportmap.h"
 

@@ -52,11 +52,12 @@
 // ZARK_UPNP_TEST_ERR_STOPPED, cleans up and ends. While the test runs,
 // KLibGetLibZarkPortMapRunningTask answers ZARK_PORTMAP_TASK_UPNP_TEST
 // (running_task.h).
-#ifndef ZARK_PORTMAP_UPNP_COMPAT_TEST_H
-#define ZARK_PORTMAP_UPNP_COMPAT_TEST_H
+#ifndef ZARK_PORTMAP_COMPAT_COMPATIBILITY_TEST_H
+#define ZARK_PORTMAP_COMPAT_COMPATIBILITY_TEST_H
 
 #include "base/running_task.h"
 #include "catalog/mapping_state.h"
+#include "compat/compatibility_files.h"
 #include "drivers/driver_choice.h"
 #include "drivers/router_driver.h"
 #include "libzarkportmap.h"
@@ -91,21 +92,6 @@ inline constexpr const char *kFinished = "finished";
 inline constexpr const char *kSuccess = "success";
 inline constexpr const char *kFailed = "failed";
 } // namespace upnp_test_value
-
-// Files of the test besides the progress file.
-inline constexpr const char *kUpnpTestRunPath =
-    ZARK_PORTMAP_CONF_DIR "/upnp_test.run";
-inline constexpr const char *kUpnpTestStopPath =
-    ZARK_PORTMAP_CONF_DIR "/upnp_test.stop";
-inline constexpr const char *kUpnpTestReportPath =
-    ZARK_PORTMAP_CONF_DIR "/upnp_test.report.json";
-
-// The description of the test's mappings in the router's table.
-inline constexpr const char *kUpnpTestDescription =
-    "zarkportforward compatibility test";
-// The most mappings one test may be asked to make.
-inline constexpr int kMaxUpnpTestMappings = 1024;
-inline constexpr uint16_t kDefaultUpnpTestFirstPort = 30500;
 
 // The run file: what a running (or killed) test may have left on the
 // router. JSON:

@@ -4,7 +4,7 @@
 #include "base/portmap_log.h"
 #include "base/strict_json.h"
 #include "base/unique_fd.h"
-#include "compat/compatibility_test.h"
+#include "compat/compatibility_files.h"
 
 #include <fcntl.h>
 #include <sys/file.h>

@@ -5,8 +5,8 @@
 //   <detail>" success: LOG_DEBUG "<file>:<line> <call>: rc=<rc> <detail>"
 // savedErrno, when not 0, is the errno the caller captured right after the
 // call (socket errors of libnatpmp) and is added as " errno=<n> (<text>)".
-#ifndef ZARK_PORTMAP_ROUTER_LOG_H
-#define ZARK_PORTMAP_ROUTER_LOG_H
+#ifndef ZARK_PORTMAP_DRIVERS_DRIVER_LOG_H
+#define ZARK_PORTMAP_DRIVERS_DRIVER_LOG_H
 
 #include <string_view>
 

@@ -25,8 +25,8 @@
 // Bounded: checks run on at most `workers` threads (owned, joined), each
 // bounded by the probe client's timeouts; checks not started before the
 // deadline are reported "not tested: time limit reached".
-#ifndef ZARK_PORTMAP_PORT_TEST_H
-#define ZARK_PORTMAP_PORT_TEST_H
+#ifndef ZARK_PORTMAP_REACH_REACHABILITY_TEST_H
+#define ZARK_PORTMAP_REACH_REACHABILITY_TEST_H
 
 #include "base/port_mapping.h"
 #include "libzarkportmap.h"
