@@ -9,6 +9,7 @@
 
 #include "syslog_capture.h"
 
+#include <ares.h>
 #include <gtest/gtest.h>
 
 #include <cstring>
@@ -247,24 +248,29 @@ TEST(DetectParseResolvConf, NameServerLinesAtMostThree) {
   EXPECT_TRUE(ParseResolvConf("nameserver\n").empty());
 }
 
-TEST(DetectParseDns, QueryForExampleComIsTheStandardOne) {
-  const Bytes expected = {0x12, 0x34, 0x01, 0x00, 0,   1,   0,   0,   0,   0,
-                          0,    0,    7,    'e',  'x', 'a', 'm', 'p', 'l', 'e',
-                          3,    'c',  'o',  'm',  0,   0,   1,   0,   1};
-  EXPECT_EQ(expected, BuildDnsQuery(0x1234, "example.com"));
-  EXPECT_EQ(expected, BuildDnsQuery(0x1234, "example.com."));
-  EXPECT_TRUE(BuildDnsQuery(1, "").empty());
-  EXPECT_TRUE(BuildDnsQuery(1, ".").empty());
-  EXPECT_TRUE(BuildDnsQuery(1, "a..b").empty());
-  EXPECT_TRUE(BuildDnsQuery(1, "a b.c").empty());
-  EXPECT_TRUE(BuildDnsQuery(1, std::string(64, 'a') + ".com").empty());
-  EXPECT_FALSE(BuildDnsQuery(1, std::string(63, 'a') + ".com").empty());
+TEST(DetectParseDns, NamesThatMayBeLookedUp) {
+  EXPECT_TRUE(IsValidDnsName("example.com"));
+  EXPECT_TRUE(IsValidDnsName("example.com."));
+  EXPECT_TRUE(IsValidDnsName("localhost"));
+  EXPECT_FALSE(IsValidDnsName(""));
+  EXPECT_FALSE(IsValidDnsName("."));
+  EXPECT_FALSE(IsValidDnsName("a..b"));
+  EXPECT_FALSE(IsValidDnsName("a b.c"));
+  EXPECT_FALSE(IsValidDnsName("a\x7f.c"));
+  EXPECT_FALSE(IsValidDnsName(std::string(64, 'a') + ".com"));
+  EXPECT_TRUE(IsValidDnsName(std::string(63, 'a') + ".com"));
   std::string longName;
   while (longName.size() < 260) {
     longName += "abcdefghi.";
   }
-  EXPECT_TRUE(BuildDnsQuery(1, longName).empty());
+  EXPECT_FALSE(IsValidDnsName(longName));
 }
+
+// The standard query for the A record of example.com (id 0xBEEF), as c-ares
+// sends it (DetectProbeDns.TheQueryIsTheStandardOneForTheARecord).
+const Bytes kExampleComQuery = {
+    0xBE, 0xEF, 0x01, 0x00, 0,   1, 0,   0,   0,   0, 0, 0, 7, 'e', 'x',
+    'a',  'm',  'p',  'l',  'e', 3, 'c', 'o', 'm', 0, 0, 1, 0, 1};
 
 Bytes Answer(const Bytes &query, const std::string &name, uint32_t address) {
   uint8_t reply[512];
@@ -273,77 +279,91 @@ Bytes Answer(const Bytes &query, const std::string &name, uint32_t address) {
   return Bytes(reply, reply + length);
 }
 
-TEST(DetectParseDns, ReadsTheAddressOfAMatchingReply) {
-  const Bytes query = BuildDnsQuery(0xBEEF, "Probe.Zark.Test");
-  const Bytes reply = Answer(query, "probe.zark.test", Ip("1.2.3.2"));
+TEST(DetectParseDns, ReadsTheAddressOfAReply) {
+  const Bytes reply = Answer(kExampleComQuery, "example.com", Ip("1.2.3.2"));
   ASSERT_FALSE(reply.empty());
-  std::optional<DnsReply> parsed =
-      ParseDnsReply(reply, 0xBEEF, "probe.zark.test");
-  ASSERT_TRUE(parsed.has_value());
-  EXPECT_EQ(kDnsNoError, parsed->rcode);
-  EXPECT_EQ(1, parsed->answerRecords);
-  EXPECT_EQ(std::vector<uint32_t>{Ip("1.2.3.2")}, parsed->addresses);
+  DnsLookup heard = ReadDnsAnswer("10.0.0.53", ARES_SUCCESS, reply);
+  EXPECT_EQ(DnsOutcome::kAnswered, heard.outcome);
+  EXPECT_EQ(kDnsNoError, heard.rcode);
+  EXPECT_EQ("10.0.0.53", heard.server);
+  EXPECT_EQ(std::vector<uint32_t>{Ip("1.2.3.2")}, heard.addresses);
+  EXPECT_EQ("10.0.0.53 answered 1.2.3.2", heard.why);
 
-  // Another id or another question is not our reply.
-  EXPECT_FALSE(ParseDnsReply(reply, 0xBEEE, "probe.zark.test").has_value());
-  EXPECT_FALSE(ParseDnsReply(reply, 0xBEEF, "other.zark.test").has_value());
-  // The query itself is not a response.
-  EXPECT_FALSE(ParseDnsReply(query, 0xBEEF, "probe.zark.test").has_value());
-  // Cut anywhere inside the header or question: refused.
-  for (std::size_t cut = 0; cut < query.size(); ++cut) {
-    EXPECT_FALSE(ParseDnsReply(Bytes(reply.begin(), reply.begin() + cut),
-                               0xBEEF, "probe.zark.test")
-                     .has_value())
-        << cut;
+  // Cut inside the answer: a reply without a readable address.
+  heard = ReadDnsAnswer("10.0.0.53", ARES_SUCCESS,
+                        Bytes(reply.begin(), reply.end() - 2));
+  EXPECT_EQ(DnsOutcome::kNoAddress, heard.outcome);
+  EXPECT_TRUE(heard.addresses.empty());
+  // Cut anywhere: never an address, never a crash.
+  for (std::size_t cut = 0; cut < reply.size(); ++cut) {
+    heard = ReadDnsAnswer("10.0.0.53", ARES_SUCCESS,
+                          Bytes(reply.begin(), reply.begin() + cut));
+    EXPECT_NE(DnsOutcome::kAnswered, heard.outcome) << cut;
+    EXPECT_TRUE(heard.addresses.empty()) << cut;
   }
-  // Cut inside the answer: a reply without the answer.
-  parsed = ParseDnsReply(Bytes(reply.begin(), reply.end() - 2), 0xBEEF,
-                         "probe.zark.test");
-  ASSERT_TRUE(parsed.has_value());
-  EXPECT_TRUE(parsed->addresses.empty());
 }
 
-TEST(DetectParseDns, ReadsNameErrorsAndCnameChains) {
-  const Bytes query = BuildDnsQuery(7, "missing.example");
-  std::optional<DnsReply> parsed =
-      ParseDnsReply(Answer(query, "other.example", 1), 7, "missing.example");
-  ASSERT_TRUE(parsed.has_value());
-  EXPECT_EQ(kDnsNameError, parsed->rcode);
-  EXPECT_TRUE(parsed->addresses.empty());
+TEST(DetectParseDns, EachCAresStatusHasItsOutcome) {
+  const Bytes nxdomain = Answer(kExampleComQuery, "other.example", 1);
+  DnsLookup heard = ReadDnsAnswer("10.0.0.53", ARES_ENOTFOUND, nxdomain);
+  EXPECT_EQ(DnsOutcome::kNameError, heard.outcome);
+  EXPECT_EQ(kDnsNameError, heard.rcode);
+  EXPECT_EQ("10.0.0.53 answered that the name does not exist", heard.why);
 
+  Bytes refused = nxdomain;
+  refused[3] = 0x80 | kDnsRefused;
+  heard = ReadDnsAnswer("10.0.0.53", ARES_EREFUSED, refused);
+  EXPECT_EQ(DnsOutcome::kServerError, heard.outcome);
+  EXPECT_EQ(kDnsRefused, heard.rcode);
+  EXPECT_EQ("10.0.0.53 answered with error 5", heard.why);
+  // Without the reply, the code comes from the status.
+  heard = ReadDnsAnswer("10.0.0.53", ARES_ESERVFAIL, {});
+  EXPECT_EQ(DnsOutcome::kServerError, heard.outcome);
+  EXPECT_EQ(kDnsServerFailure, heard.rcode);
+
+  Bytes noRecord = nxdomain;
+  noRecord[3] = 0x80;
+  heard = ReadDnsAnswer("10.0.0.53", ARES_ENODATA, noRecord);
+  EXPECT_EQ(DnsOutcome::kNoAddress, heard.outcome);
+  EXPECT_EQ("10.0.0.53 answered without an address", heard.why);
+
+  heard = ReadDnsAnswer("10.0.0.53", ARES_ECONNREFUSED, {});
+  EXPECT_EQ(DnsOutcome::kServerError, heard.outcome);
+  EXPECT_EQ("10.0.0.53: Connection refused", heard.why);
+  EXPECT_EQ(DnsOutcome::kNoAnswer,
+            ReadDnsAnswer("10.0.0.53", ARES_ETIMEOUT, {}).outcome);
+  EXPECT_EQ(DnsOutcome::kNoAnswer,
+            ReadDnsAnswer("10.0.0.53", ARES_ECANCELLED, {}).outcome);
+  heard = ReadDnsAnswer("10.0.0.53", ARES_ENOMEM, {});
+  EXPECT_EQ(DnsOutcome::kFailed, heard.outcome);
+  EXPECT_EQ("10.0.0.53: Out of memory", heard.why);
+}
+
+TEST(DetectParseDns, FollowsCnameChainsAndRefusesLoopingPointers) {
   // www.example -> CNAME example (compressed) -> A 203.0.113.80.
-  Bytes reply = BuildDnsQuery(9, "www.example");
-  reply[2] = 0x81;
-  reply[3] = 0x80;
-  reply[7] = 2;
+  Bytes reply = {0,   9,   0x81, 0x80, 0,   1,   0, 2,   0,   0,
+                 0,   0,   3,    'w',  'w', 'w', 7, 'e', 'x', 'a',
+                 'm', 'p', 'l',  'e',  0,   0,   1, 0,   1};
   const Bytes records = {
       0xC0, 12, 0, 5, 0, 1, 0, 0, 0, 60, 0, 2, 0xC0, 16, // CNAME -> example
       0xC0, 16, 0, 1, 0, 1, 0, 0, 0, 60, 0, 4, 203,  0,  113, 80};
   reply.insert(reply.end(), records.begin(), records.end());
-  parsed = ParseDnsReply(reply, 9, "www.example");
-  ASSERT_TRUE(parsed.has_value());
-  EXPECT_EQ(2, parsed->answerRecords);
-  EXPECT_EQ(std::vector<uint32_t>{Ip("203.0.113.80")}, parsed->addresses);
-}
+  DnsLookup heard = ReadDnsAnswer("10.0.0.53", ARES_SUCCESS, reply);
+  EXPECT_EQ(DnsOutcome::kAnswered, heard.outcome) << heard.why;
+  EXPECT_EQ(std::vector<uint32_t>{Ip("203.0.113.80")}, heard.addresses);
 
-TEST(DetectParseDns, RefusesLoopingOrForwardCompressionPointers) {
-  Bytes reply = BuildDnsQuery(9, "a.example");
-  reply[2] = 0x81;
-  reply[7] = 1;
   // An answer whose name points at itself.
-  const std::size_t at = reply.size();
-  reply.push_back(0xC0);
-  reply.push_back(static_cast<uint8_t>(at));
+  Bytes looping = kExampleComQuery;
+  looping[2] = 0x81;
+  looping[7] = 1;
+  const std::size_t at = looping.size();
+  looping.push_back(0xC0);
+  looping.push_back(static_cast<uint8_t>(at));
   const Bytes rest = {0, 1, 0, 1, 0, 0, 0, 60, 0, 4, 1, 2, 3, 4};
-  reply.insert(reply.end(), rest.begin(), rest.end());
-  std::optional<DnsReply> parsed = ParseDnsReply(reply, 9, "a.example");
-  ASSERT_TRUE(parsed.has_value());
-  EXPECT_EQ(0, parsed->answerRecords);
-
-  // A question name that points forward.
-  Bytes forward = {0, 9, 0x81, 0x80, 0, 1, 0, 0, 0, 0,
-                   0, 0, 0xC0, 14,   0, 0, 1, 0, 1};
-  EXPECT_FALSE(ParseDnsReply(forward, 9, "a.example").has_value());
+  looping.insert(looping.end(), rest.begin(), rest.end());
+  heard = ReadDnsAnswer("10.0.0.53", ARES_SUCCESS, looping);
+  EXPECT_EQ(DnsOutcome::kNoAddress, heard.outcome);
+  EXPECT_TRUE(heard.addresses.empty());
 }
 
 // --- SSDP --------------------------------------------------------------------

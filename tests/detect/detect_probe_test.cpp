@@ -138,6 +138,33 @@ DnsClientOptions DnsOptions(uint16_t port) {
   return options;
 }
 
+// What one lookup of name by c-ares gets from a fake name server on
+// loopback that answers with handler.
+DnsLookup LookupFrom(const UdpResponder::Handler &handler,
+                     std::string_view name,
+                     milliseconds budget = milliseconds(2000)) {
+  UdpResponder server(handler);
+  std::unique_ptr<DnsClient> client =
+      MakeUdpDnsClient(DnsOptions(server.Port()));
+  const std::vector<std::string> servers = {"127.0.0.1"};
+  return client->Lookup(servers, name, budget);
+}
+
+// The reply of the fake name server to request (answering name with
+// address), changed by edit.
+UdpResponder::Handler
+EditedAnswer(std::function<void(UdpResponder::Bytes &reply)> edit) {
+  return [edit](const UdpResponder::Bytes &request) {
+    uint8_t reply[512];
+    const std::size_t length =
+        BuildDnsAnswer(request.data(), request.size(), "probe.zark.test",
+                       Ip("1.2.3.2"), reply, sizeof(reply));
+    UdpResponder::Bytes edited(reply, reply + length);
+    edit(edited);
+    return std::vector<UdpResponder::Bytes>{edited};
+  };
+}
+
 TEST(DetectProbeDns, AServerThatAnswersGivesTheAddress) {
   UdpResponder server(DnsServer("probe.zark.test", Ip("1.2.3.2")));
   std::unique_ptr<DnsClient> client =
@@ -148,14 +175,32 @@ TEST(DetectProbeDns, AServerThatAnswersGivesTheAddress) {
   EXPECT_EQ(DnsOutcome::kAnswered, lookup.outcome) << lookup.why;
   EXPECT_EQ(std::vector<uint32_t>{Ip("1.2.3.2")}, lookup.addresses);
   EXPECT_EQ("127.0.0.1 answered 1.2.3.2", lookup.why);
+  EXPECT_EQ("127.0.0.1", lookup.server);
+  EXPECT_EQ(kDnsNoError, lookup.rcode);
   ASSERT_EQ(1, server.Received());
-  // A standard recursive query for the A record.
-  const UdpResponder::Bytes query = server.Requests()[0];
-  ASSERT_GE(query.size(), 12u);
-  EXPECT_EQ(0x01, query[2]);
-  EXPECT_EQ(BuildDnsQuery(static_cast<uint16_t>(query[0] << 8 | query[1]),
-                          "probe.zark.test"),
-            query);
+}
+
+TEST(DetectProbeDns, TheQueryIsTheStandardOneForTheARecord) {
+  UdpResponder server(DnsServer("example.com", Ip("1.2.3.2")));
+  std::unique_ptr<DnsClient> client =
+      MakeUdpDnsClient(DnsOptions(server.Port()));
+  const std::vector<std::string> servers = {"127.0.0.1"};
+  for (const char *name : {"example.com", "example.com."}) {
+    EXPECT_EQ(DnsOutcome::kAnswered,
+              client->Lookup(servers, name, milliseconds(2000)).outcome)
+        << name;
+  }
+  // A standard query, recursion desired, one question, no other record:
+  // the A record of example.com, class IN; only the id is c-ares's choice.
+  const std::vector<UdpResponder::Bytes> queries = server.Requests();
+  ASSERT_EQ(2u, queries.size());
+  for (const UdpResponder::Bytes &query : queries) {
+    const UdpResponder::Bytes expected = {
+        query[0], query[1], 0x01, 0x00, 0,   1,   0,   0,   0,   0,
+        0,        0,        7,    'e',  'x', 'a', 'm', 'p', 'l', 'e',
+        3,        'c',      'o',  'm',  0,   0,   1,   0,   1};
+    EXPECT_EQ(expected, query);
+  }
 }
 
 TEST(DetectProbeDns, NoSuchNameIsAnAnswerWithoutAddress) {
@@ -167,6 +212,9 @@ TEST(DetectProbeDns, NoSuchNameIsAnAnswerWithoutAddress) {
       client->Lookup(servers, "other.zark.test", milliseconds(2000));
   EXPECT_EQ(DnsOutcome::kNameError, lookup.outcome);
   EXPECT_EQ(kDnsNameError, lookup.rcode);
+  EXPECT_TRUE(lookup.addresses.empty());
+  EXPECT_EQ("127.0.0.1 answered that the name does not exist", lookup.why);
+  EXPECT_EQ(1, server.Received());
 }
 
 TEST(DetectProbeDns, ASilentServerIsAskedTwiceThenGivenUpOn) {
@@ -176,11 +224,32 @@ TEST(DetectProbeDns, ASilentServerIsAskedTwiceThenGivenUpOn) {
   std::unique_ptr<DnsClient> client =
       MakeUdpDnsClient(DnsOptions(server.Port()));
   const std::vector<std::string> servers = {"127.0.0.1"};
+  const auto start = std::chrono::steady_clock::now();
   DnsLookup lookup =
       client->Lookup(servers, "probe.zark.test", milliseconds(1000));
+  EXPECT_LT(std::chrono::steady_clock::now() - start, milliseconds(1500));
   EXPECT_EQ(DnsOutcome::kNoAnswer, lookup.outcome);
   EXPECT_EQ("no name server answered within 1000 ms", lookup.why);
   EXPECT_EQ(2, server.Received());
+}
+
+TEST(DetectProbeDns, TheBudgetEndsTheLookupBeforeCAresGivesUp) {
+  UdpResponder server([](const UdpResponder::Bytes &) {
+    return std::vector<UdpResponder::Bytes>{};
+  });
+  DnsClientOptions options = DnsOptions(server.Port());
+  options.resendAfter = milliseconds(5000);
+  std::unique_ptr<DnsClient> client = MakeUdpDnsClient(options);
+  const std::vector<std::string> servers = {"127.0.0.1"};
+  const auto start = std::chrono::steady_clock::now();
+  DnsLookup lookup =
+      client->Lookup(servers, "probe.zark.test", milliseconds(200));
+  const auto took = std::chrono::steady_clock::now() - start;
+  EXPECT_GE(took, milliseconds(200));
+  EXPECT_LT(took, milliseconds(1000));
+  EXPECT_EQ(DnsOutcome::kNoAnswer, lookup.outcome);
+  EXPECT_EQ("no name server answered within 200 ms", lookup.why);
+  EXPECT_EQ(1, server.Received());
 }
 
 TEST(DetectProbeDns, ForeignDatagramsAreIgnoredUntilTheRealReply) {
@@ -193,8 +262,19 @@ TEST(DetectProbeDns, ForeignDatagramsAreIgnoredUntilTheRealReply) {
         BuildDnsAnswer(wrongId.data(), wrongId.size(), "probe.zark.test",
                        Ip("9.9.9.9"), reply, sizeof(reply));
     replies.emplace_back(reply, reply + length);
+    // The same id for another question.
+    UdpResponder::Bytes otherName = request;
+    otherName[13] = 'q';
+    length =
+        BuildDnsAnswer(otherName.data(), otherName.size(), "qrobe.zark.test",
+                       Ip("9.9.9.8"), reply, sizeof(reply));
+    replies.emplace_back(reply, reply + length);
+    // The real reply cut anywhere inside its header or question.
     length = BuildDnsAnswer(request.data(), request.size(), "probe.zark.test",
                             Ip("1.2.3.2"), reply, sizeof(reply));
+    for (std::size_t cut = 1; cut < request.size(); ++cut) {
+      replies.emplace_back(reply, reply + cut);
+    }
     replies.emplace_back(reply, reply + length);
     return replies;
   });
@@ -203,8 +283,70 @@ TEST(DetectProbeDns, ForeignDatagramsAreIgnoredUntilTheRealReply) {
   const std::vector<std::string> servers = {"127.0.0.1"};
   DnsLookup lookup =
       client->Lookup(servers, "probe.zark.test", milliseconds(2000));
-  EXPECT_EQ(DnsOutcome::kAnswered, lookup.outcome);
+  EXPECT_EQ(DnsOutcome::kAnswered, lookup.outcome) << lookup.why;
   EXPECT_EQ(std::vector<uint32_t>{Ip("1.2.3.2")}, lookup.addresses);
+}
+
+TEST(DetectProbeDns, AnAnswerCutShortHasNoAddress) {
+  DnsLookup lookup = LookupFrom(EditedAnswer([](UdpResponder::Bytes &reply) {
+                                  reply.resize(reply.size() - 2);
+                                }),
+                                "probe.zark.test");
+  EXPECT_EQ(DnsOutcome::kNoAddress, lookup.outcome) << lookup.why;
+  EXPECT_TRUE(lookup.addresses.empty());
+  EXPECT_EQ("127.0.0.1 answered without an address (Misformatted DNS reply)",
+            lookup.why);
+}
+
+TEST(DetectProbeDns, ACnameChainLeadsToTheAddress) {
+  // probe.zark.test -> CNAME zark.test (compressed) -> A 203.0.113.80.
+  DnsLookup lookup = LookupFrom(
+      EditedAnswer([](UdpResponder::Bytes &reply) {
+        reply.resize(reply.size() - 16); // the fake's own A record
+        reply[7] = 2;
+        const UdpResponder::Bytes records = {
+            0xC0, 12, 0, 5, 0, 1, 0, 0, 0, 60, 0, 2, 0xC0, 18, // CNAME
+            0xC0, 18, 0, 1, 0, 1, 0, 0, 0, 60, 0, 4, 203,  0,  113, 80};
+        reply.insert(reply.end(), records.begin(), records.end());
+      }),
+      "probe.zark.test");
+  EXPECT_EQ(DnsOutcome::kAnswered, lookup.outcome) << lookup.why;
+  EXPECT_EQ(std::vector<uint32_t>{Ip("203.0.113.80")}, lookup.addresses);
+}
+
+TEST(DetectProbeDns, ALoopingCompressionPointerIsNoAddress) {
+  // An answer whose name points at itself.
+  DnsLookup lookup = LookupFrom(EditedAnswer([](UdpResponder::Bytes &reply) {
+                                  const std::size_t at = reply.size() - 16;
+                                  reply[at] = 0xC0;
+                                  reply[at + 1] = static_cast<uint8_t>(at);
+                                }),
+                                "probe.zark.test");
+  EXPECT_EQ(DnsOutcome::kNoAddress, lookup.outcome) << lookup.why;
+  EXPECT_TRUE(lookup.addresses.empty());
+}
+
+TEST(DetectProbeDns, AnErrorAnswerIsAServerErrorWithItsCode) {
+  for (const uint8_t rcode :
+       {uint8_t{kDnsServerFailure}, uint8_t{kDnsRefused}, uint8_t{9}}) {
+    DnsLookup lookup =
+        LookupFrom(EditedAnswer([rcode](UdpResponder::Bytes &reply) {
+                     reply[3] = static_cast<uint8_t>(0x80 | rcode);
+                   }),
+                   "probe.zark.test");
+    EXPECT_EQ(DnsOutcome::kServerError, lookup.outcome) << lookup.why;
+    EXPECT_EQ(rcode, lookup.rcode);
+    EXPECT_EQ("127.0.0.1 answered with error " + std::to_string(rcode),
+              lookup.why);
+  }
+  // No error, no record.
+  DnsLookup lookup = LookupFrom(EditedAnswer([](UdpResponder::Bytes &reply) {
+                                  reply.resize(reply.size() - 16);
+                                  reply[7] = 0;
+                                }),
+                                "probe.zark.test");
+  EXPECT_EQ(DnsOutcome::kNoAddress, lookup.outcome);
+  EXPECT_EQ("127.0.0.1 answered without an address", lookup.why);
 }
 
 TEST(DetectProbeDns, AServerWhereNothingListensIsRefusedAndTheOtherAnswers) {
@@ -234,6 +376,13 @@ TEST(DetectProbeDns, NothingToAskFails) {
   EXPECT_EQ(DnsOutcome::kFailed,
             client->Lookup(servers, "bad name", milliseconds(100)).outcome);
   EXPECT_TRUE(HasLogContaining("DNS probe: \"bad name\" is not a valid name"));
+  ClearLogs();
+  const std::vector<std::string> notAddress = {"ns.example"};
+  EXPECT_EQ(
+      DnsOutcome::kFailed,
+      client->Lookup(notAddress, "probe.zark.test", milliseconds(100)).outcome);
+  EXPECT_TRUE(HasLogContaining(
+      "DNS probe: name server \"ns.example\" is not an address"));
 }
 
 // --- SSDP

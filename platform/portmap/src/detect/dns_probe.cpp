@@ -2,35 +2,40 @@
 
 #include "base/local_network.h"
 #include "base/portmap_log.h"
-#include "base/unique_fd.h"
 
+#include <ares.h>
 #include <arpa/inet.h>
+#include <arpa/nameser.h>
 #include <netinet/in.h>
 #include <poll.h>
-#include <sys/random.h>
-#include <sys/socket.h>
 
 #include <algorithm>
-#include <cctype>
+#include <array>
 #include <cerrno>
 #include <cstring>
+#include <mutex>
 
 namespace zark::portmap {
+
 namespace {
 
 using Clock = std::chrono::steady_clock;
 
-constexpr std::size_t kHeaderBytes = 12;
-constexpr uint16_t kTypeA = 1;
-constexpr uint16_t kClassIn = 1;
-constexpr uint16_t kFlagResponse = 0x8000;
-constexpr uint16_t kFlagTruncated = 0x0200;
-constexpr uint16_t kFlagRecursionDesired = 0x0100;
-constexpr uint16_t kOpcodeMask = 0x7800;
-constexpr uint16_t kRcodeMask = 0x000F;
-constexpr int kMaxPointers = 16;
+// Our names of the reply codes are <arpa/nameser.h>'s.
+constexpr bool SameRcode(DnsRcode ours, int nameser) {
+  return static_cast<int>(ours) == nameser;
+}
+static_assert(SameRcode(kDnsNoError, ns_r_noerror) &&
+              SameRcode(kDnsFormatError, ns_r_formerr) &&
+              SameRcode(kDnsServerFailure, ns_r_servfail) &&
+              SameRcode(kDnsNameError, ns_r_nxdomain) &&
+              SameRcode(kDnsNotImplemented, ns_r_notimpl) &&
+              SameRcode(kDnsRefused, ns_r_refused));
+
 constexpr std::size_t kMaxNameText = 253;
-constexpr std::size_t kMaxReplyBytes = 4096;
+constexpr std::size_t kMaxLabel = 63;
+// More A records than a 512-byte reply can hold.
+constexpr int kMaxAddresses = 64;
 
 std::string_view Trim(std::string_view text) {
   const std::size_t start = text.find_first_not_of(" \t\r");
@@ -39,112 +44,6 @@ std::string_view Trim(std::string_view text) {
   }
   const std::size_t end = text.find_last_not_of(" \t\r");
   return text.substr(start, end - start + 1);
-}
-
-// The labels of a name, or nothing when it is not a valid one.
-std::optional<std::vector<std::string_view>> Labels(std::string_view name) {
-  if (!name.empty() && name.back() == '.') {
-    name.remove_suffix(1);
-  }
-  if (name.empty() || name.size() > kMaxNameText) {
-    return std::nullopt;
-  }
-  std::vector<std::string_view> labels;
-  while (true) {
-    const std::size_t dot = name.find('.');
-    std::string_view label = name.substr(0, dot);
-    if (label.empty() || label.size() > 63 ||
-        std::any_of(label.begin(), label.end(), [](char c) {
-          return static_cast<unsigned char>(c) <= 0x20 ||
-                 static_cast<unsigned char>(c) >= 0x7F;
-        })) {
-      return std::nullopt;
-    }
-    labels.push_back(label);
-    if (dot == std::string_view::npos) {
-      break;
-    }
-    name.remove_prefix(dot + 1);
-  }
-  return labels;
-}
-
-uint16_t Get16(std::span<const uint8_t> bytes, std::size_t at) {
-  return static_cast<uint16_t>((bytes[at] << 8) | bytes[at + 1]);
-}
-
-// Reads the name at offset (compression pointers followed, at most
-// kMaxPointers, each strictly backwards) as lower-case dotted text; offset
-// moves past the name as it is stored where it starts.
-bool ReadName(std::span<const uint8_t> bytes, std::size_t &offset,
-              std::string &name) {
-  name.clear();
-  std::size_t at = offset;
-  bool jumped = false;
-  int pointers = 0;
-  for (;;) {
-    if (at >= bytes.size()) {
-      return false;
-    }
-    const uint8_t length = bytes[at];
-    if ((length & 0xC0) == 0xC0) {
-      if (at + 1 >= bytes.size() || ++pointers > kMaxPointers) {
-        return false;
-      }
-      const std::size_t target = ((length & 0x3F) << 8) | bytes[at + 1];
-      if (target >= at) {
-        return false;
-      }
-      if (!jumped) {
-        offset = at + 2;
-        jumped = true;
-      }
-      at = target;
-      continue;
-    }
-    if ((length & 0xC0) != 0) {
-      return false; // the reserved label types 0x40 and 0x80
-    }
-    if (length == 0) {
-      if (!jumped) {
-        offset = at + 1;
-      }
-      return true;
-    }
-    if (at + 1 + length > bytes.size() ||
-        name.size() + length + 1 > kMaxNameText + 1) {
-      return false;
-    }
-    if (!name.empty()) {
-      name += '.';
-    }
-    for (std::size_t i = 0; i < length; ++i) {
-      name += static_cast<char>(
-          std::tolower(static_cast<unsigned char>(bytes[at + 1 + i])));
-    }
-    at += 1 + length;
-  }
-}
-
-std::string Lower(std::string_view text) {
-  std::string lower(text);
-  for (char &c : lower) {
-    c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
-  }
-  if (!lower.empty() && lower.back() == '.') {
-    lower.pop_back();
-  }
-  return lower;
-}
-
-uint16_t RandomId() {
-  uint16_t id = 0;
-  if (::getrandom(&id, sizeof(id), GRND_NONBLOCK) != sizeof(id)) {
-    // Without the kernel's randomness the id only has to differ from the
-    // last run's; the clock does that.
-    id = static_cast<uint16_t>(Clock::now().time_since_epoch().count());
-  }
-  return id;
 }
 
 std::string ErrnoText(int error) {
@@ -171,6 +70,59 @@ int Rank(DnsOutcome outcome) {
   return 0;
 }
 
+// The RCODE c-ares turned into status (ares_query's callback), or the
+// reply's own when c-ares left an unusual one as ARES_SUCCESS.
+int ReplyRcode(int status, std::span<const uint8_t> reply) {
+  if (reply.size() >= sizeof(HEADER)) {
+    HEADER header;
+    std::memcpy(&header, reply.data(), sizeof(header));
+    return header.rcode;
+  }
+  switch (status) {
+  case ARES_EFORMERR:
+    return ns_r_formerr;
+  case ARES_ESERVFAIL:
+    return ns_r_servfail;
+  case ARES_ENOTFOUND:
+    return ns_r_nxdomain;
+  case ARES_ENOTIMP:
+    return ns_r_notimpl;
+  case ARES_EREFUSED:
+    return ns_r_refused;
+  default:
+    return ns_r_noerror;
+  }
+}
+
+// ares_library_init once per process, whichever thread gets here first.
+int AresLibraryStatus() {
+  static std::once_flag once;
+  static int status = ARES_SUCCESS;
+  std::call_once(once, [] { status = ares_library_init(ARES_LIB_INIT_ALL); });
+  return status;
+}
+
+struct AresChannelDeleter {
+  void operator()(ares_channeldata *channel) const { ares_destroy(channel); }
+};
+// Destroying the channel ends its queries: their callbacks run with
+// ARES_EDESTRUCTION before it returns.
+using AresChannel = std::unique_ptr<ares_channeldata, AresChannelDeleter>;
+
+// "a.b.c.d:port" or "[v6]:port", as ares_set_servers_ports_csv reads it;
+// empty when server is not an address.
+std::string ServerCsv(const std::string &server, uint16_t port) {
+  in_addr v4{};
+  in6_addr v6{};
+  if (::inet_pton(AF_INET, server.c_str(), &v4) == 1) {
+    return server + ":" + std::to_string(port);
+  }
+  if (::inet_pton(AF_INET6, server.c_str(), &v6) == 1) {
+    return "[" + server + "]:" + std::to_string(port);
+  }
+  return {};
+}
+
 class UdpDnsClient final : public DnsClient {
 public:
   explicit UdpDnsClient(DnsClientOptions options) : mOptions(options) {}
@@ -180,23 +132,25 @@ public:
     DnsLookup best;
     best.outcome = DnsOutcome::kFailed;
     best.why = "no query could be sent";
-    std::vector<Query> queries;
+    if (!IsValidDnsName(name)) {
+      best.why = "\"" + std::string(name) + "\" is not a valid name";
+      ZARK_PM_LOG_ERROR("DNS probe: %s", best.why.c_str());
+      return best;
+    }
+    if (const int status = AresLibraryStatus(); status != ARES_SUCCESS) {
+      ZARK_PM_LOG_CALL("ares_library_init", status, 0, ares_strerror(status));
+      return best;
+    }
+    const std::string nameText(name);
+    std::vector<std::unique_ptr<Query>> queries;
     for (const std::string &server : servers) {
-      Query query;
-      query.server = server;
-      query.id = RandomId();
-      query.packet = BuildDnsQuery(query.id, name);
-      if (query.packet.empty()) {
-        best.why = "\"" + std::string(name) + "\" is not a valid name";
-        ZARK_PM_LOG_ERROR("DNS probe: %s", best.why.c_str());
-        return best;
-      }
-      if (!Open(query)) {
+      auto query = std::make_unique<Query>();
+      query->server = server;
+      if (!Open(*query)) {
         continue;
       }
-      if (!Send(query)) {
-        continue;
-      }
+      ares_query(query->channel.get(), nameText.c_str(), ns_c_in, ns_t_a,
+                 OnReply, query.get());
       queries.push_back(std::move(query));
     }
     if (queries.empty()) {
@@ -206,58 +160,31 @@ public:
     best.why = "no name server answered within " +
                std::to_string(budget.count()) + " ms";
 
-    const Clock::time_point start = Clock::now();
-    const Clock::time_point deadline = start + budget;
-    bool resent = false;
+    const Clock::time_point deadline = Clock::now() + budget;
     for (;;) {
-      std::vector<pollfd> watched;
-      std::vector<Query *> owners;
-      for (Query &query : queries) {
-        if (!query.done) {
-          watched.push_back({query.fd.Get(), POLLIN, 0});
-          owners.push_back(&query);
+      std::vector<Query *> pending;
+      for (const std::unique_ptr<Query> &query : queries) {
+        if (!query->heard) {
+          pending.push_back(query.get());
+          continue;
+        }
+        if (query->counted) {
+          continue;
+        }
+        query->counted = true;
+        if (query->heard->outcome == DnsOutcome::kAnswered) {
+          return *query->heard;
+        }
+        if (Rank(query->heard->outcome) > Rank(best.outcome)) {
+          best = *query->heard;
         }
       }
       const Clock::time_point now = Clock::now();
-      if (watched.empty() || now >= deadline) {
+      if (pending.empty() || now >= deadline) {
+        return best; // the channels still asking are destroyed
+      }
+      if (!Wait(pending, deadline - now)) {
         return best;
-      }
-      if (!resent && now >= start + mOptions.resendAfter) {
-        resent = true;
-        for (Query *query : owners) {
-          (void)Send(*query);
-        }
-      }
-      const Clock::time_point wakeUp =
-          resent ? deadline : std::min(deadline, start + mOptions.resendAfter);
-      const auto wait =
-          std::chrono::duration_cast<std::chrono::milliseconds>(wakeUp - now);
-      const int ready =
-          ::poll(watched.data(), watched.size(),
-                 static_cast<int>(std::max<long>(wait.count(), 0)) + 1);
-      if (ready < 0) {
-        if (errno == EINTR) {
-          continue;
-        }
-        ZARK_PM_LOG_CALL("poll", ready, errno, "(DNS probe)");
-        return best;
-      }
-      for (std::size_t i = 0; i < watched.size(); ++i) {
-        if (watched[i].revents == 0) {
-          continue;
-        }
-        Query &query = *owners[i];
-        std::optional<DnsLookup> heard = Receive(query, name);
-        if (!heard) {
-          continue;
-        }
-        query.done = true;
-        if (heard->outcome == DnsOutcome::kAnswered) {
-          return *heard;
-        }
-        if (Rank(heard->outcome) > Rank(best.outcome)) {
-          best = *heard;
-        }
       }
     }
   }
@@ -265,103 +192,144 @@ public:
 private:
   struct Query {
     std::string server;
-    UniqueFd fd;
-    uint16_t id = 0;
-    std::vector<uint8_t> packet;
-    bool done = false;
+    std::optional<DnsLookup> heard; // what the callback made of the end
+    bool counted = false;
+    // Last, so that it is destroyed first: its callbacks still find the
+    // members above.
+    AresChannel channel;
   };
 
-  // A UDP socket connected to the server: only the server's own replies
-  // come in, and an ICMP "port unreachable" shows as ECONNREFUSED.
+  // ares_query's callback. c-ares calls it once per query: with the reply,
+  // with the error that ended it, or with ARES_EDESTRUCTION when the budget
+  // ran out and the channel is destroyed.
+  static void OnReply(void *arg, int status, int, unsigned char *reply,
+                      int length) {
+    auto *query = static_cast<Query *>(arg);
+    if (status == ARES_EDESTRUCTION) {
+      return;
+    }
+    try {
+      query->heard =
+          ReadDnsAnswer(query->server, status,
+                        reply == nullptr || length <= 0
+                            ? std::span<const uint8_t>()
+                            : std::span<const uint8_t>(
+                                  reply, static_cast<std::size_t>(length)));
+    } catch (...) {
+      // Nothing may leave a C callback; an allocation failure here counts
+      // as no answer from this server.
+      query->heard.emplace();
+      query->heard->outcome = DnsOutcome::kNoAnswer;
+    }
+  }
+
+  // A channel that asks query.server alone, over UDP only, and reads no
+  // system file: every setting c-ares would take from /etc/resolv.conf is
+  // given, so that it does not open it.
   bool Open(Query &query) const {
-    sockaddr_storage address{};
-    socklen_t length = 0;
-    auto *v4 = reinterpret_cast<sockaddr_in *>(&address);
-    auto *v6 = reinterpret_cast<sockaddr_in6 *>(&address);
-    if (::inet_pton(AF_INET, query.server.c_str(), &v4->sin_addr) == 1) {
-      v4->sin_family = AF_INET;
-      v4->sin_port = htons(mOptions.port);
-      length = sizeof(sockaddr_in);
-    } else if (::inet_pton(AF_INET6, query.server.c_str(), &v6->sin6_addr) ==
-               1) {
-      v6->sin6_family = AF_INET6;
-      v6->sin6_port = htons(mOptions.port);
-      length = sizeof(sockaddr_in6);
-    } else {
+    const std::string csv = ServerCsv(query.server, mOptions.port);
+    if (csv.empty()) {
       ZARK_PM_LOG_ERROR("DNS probe: name server \"%s\" is not an address",
                         query.server.c_str());
       return false;
     }
-    query.fd.Reset(::socket(address.ss_family,
-                            SOCK_DGRAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0));
-    if (!query.fd.Valid()) {
-      ZARK_PM_LOG_CALL("socket", -1, errno, "(DNS probe)");
+    ares_options options{};
+    options.flags = ARES_FLAG_IGNTC | ARES_FLAG_NOCHECKRESP |
+                    ARES_FLAG_NOSEARCH | ARES_FLAG_NOALIASES;
+    options.timeout = static_cast<int>(mOptions.resendAfter.count());
+    options.tries = 2;
+    options.ndots = 1;
+    options.servers = nullptr;
+    options.nservers = 0;
+    options.domains = nullptr;
+    options.ndomains = 0;
+    options.sortlist = nullptr;
+    options.nsort = 0;
+    char lookups[] = "b"; // DNS only, no hosts file
+    options.lookups = lookups;
+    const int mask = ARES_OPT_FLAGS | ARES_OPT_TIMEOUTMS | ARES_OPT_TRIES |
+                     ARES_OPT_NDOTS | ARES_OPT_SERVERS | ARES_OPT_DOMAINS |
+                     ARES_OPT_SORTLIST | ARES_OPT_LOOKUPS | ARES_OPT_NOROTATE;
+    ares_channel raw = nullptr;
+    int status = ares_init_options(&raw, &options, mask);
+    if (status != ARES_SUCCESS) {
+      ZARK_PM_LOG_CALL(
+          "ares_init_options", status, 0,
+          ("(DNS probe) " + std::string(ares_strerror(status))).c_str());
       return false;
     }
-    if (::connect(query.fd.Get(), reinterpret_cast<sockaddr *>(&address),
-                  length) != 0) {
-      ZARK_PM_LOG_CALL(
-          "connect", -1, errno,
-          ("(DNS probe, name server " + query.server + ")").c_str());
+    query.channel.reset(raw);
+    status = ares_set_servers_ports_csv(raw, csv.c_str());
+    if (status != ARES_SUCCESS) {
+      ZARK_PM_LOG_CALL("ares_set_servers_ports_csv", status, 0,
+                       ("(DNS probe, name server " + query.server + ") " +
+                        ares_strerror(status))
+                           .c_str());
       return false;
     }
     return true;
   }
 
-  static bool Send(Query &query) {
-    const ssize_t sent = ::send(query.fd.Get(), query.packet.data(),
-                                query.packet.size(), MSG_NOSIGNAL);
-    if (sent != static_cast<ssize_t>(query.packet.size())) {
-      ZARK_PM_LOG_CALL(
-          "send", sent, errno,
-          ("(DNS probe, name server " + query.server + ")").c_str());
-      return false;
-    }
-    return true;
-  }
-
-  // One datagram from the server: nothing when it is not a reply to our
-  // query (kept waiting for the real one), else what it says.
-  static std::optional<DnsLookup> Receive(Query &query, std::string_view name) {
-    uint8_t buffer[kMaxReplyBytes];
-    const ssize_t got = ::recv(query.fd.Get(), buffer, sizeof(buffer), 0);
-    DnsLookup heard;
-    heard.server = query.server;
-    if (got < 0) {
-      if (errno == EAGAIN || errno == EWOULDBLOCK || errno == EINTR) {
-        return std::nullopt;
+  // Waits for the sockets of the pending queries, at most left (and no
+  // longer than the first retry or timeout c-ares has planned), then lets
+  // each channel read what came and act on its timers. False on a poll
+  // failure (logged).
+  static bool Wait(const std::vector<Query *> &pending, Clock::duration left) {
+    const auto leftUs =
+        std::chrono::duration_cast<std::chrono::microseconds>(left).count();
+    timeval wait{static_cast<time_t>(leftUs / 1000000),
+                 static_cast<suseconds_t>(leftUs % 1000000)};
+    std::vector<pollfd> watched;
+    std::vector<Query *> owners;
+    for (Query *query : pending) {
+      std::array<ares_socket_t, ARES_GETSOCK_MAXNUM> sockets{};
+      const int bits = ares_getsock(query->channel.get(), sockets.data(),
+                                    static_cast<int>(sockets.size()));
+      for (int i = 0; i < ARES_GETSOCK_MAXNUM; ++i) {
+        const short events =
+            static_cast<short>((ARES_GETSOCK_READABLE(bits, i) ? POLLIN : 0) |
+                               (ARES_GETSOCK_WRITABLE(bits, i) ? POLLOUT : 0));
+        if (events != 0) {
+          watched.push_back({sockets[static_cast<std::size_t>(i)], events, 0});
+          owners.push_back(query);
+        }
       }
-      heard.outcome = DnsOutcome::kServerError;
-      heard.why = query.server + ": " + ErrnoText(errno);
-      return heard;
+      timeval until{};
+      const timeval *next = ares_timeout(query->channel.get(), &wait, &until);
+      wait = *next;
     }
-    std::optional<DnsReply> reply = ParseDnsReply(
-        std::span<const uint8_t>(buffer, static_cast<std::size_t>(got)),
-        query.id, name);
-    if (!reply) {
-      ZARK_PM_LOG_ERROR("DNS probe: a datagram of %zd bytes from %s is not a "
-                        "reply to our query; ignored",
-                        got, query.server.c_str());
-      return std::nullopt;
+    // Rounded up: waking before c-ares's timer is due would spin.
+    const int waitMs =
+        static_cast<int>(wait.tv_sec * 1000 + (wait.tv_usec + 999) / 1000);
+    const int ready = ::poll(watched.data(), watched.size(), waitMs);
+    if (ready < 0) {
+      if (errno == EINTR) {
+        return true;
+      }
+      ZARK_PM_LOG_CALL("poll", ready, errno, "(DNS probe)");
+      return false;
     }
-    heard.rcode = reply->rcode;
-    heard.addresses = reply->addresses;
-    if (reply->rcode == kDnsNoError && !reply->addresses.empty()) {
-      heard.outcome = DnsOutcome::kAnswered;
-      heard.why =
-          query.server + " answered " + FormatIpv4(reply->addresses.front());
-    } else if (reply->rcode == kDnsNoError) {
-      heard.outcome = DnsOutcome::kNoAddress;
-      heard.why = query.server + " answered without an address";
-    } else if (reply->rcode == kDnsNameError) {
-      heard.outcome = DnsOutcome::kNameError;
-      heard.why = query.server + " answered that the name does not exist";
-    } else {
-      heard.outcome = DnsOutcome::kServerError;
-      heard.why =
-          query.server + " answered with error " + std::to_string(reply->rcode);
+    std::vector<Query *> served;
+    for (std::size_t i = 0; i < watched.size(); ++i) {
+      if (watched[i].revents == 0) {
+        continue;
+      }
+      // An error (an ICMP "port unreachable" on the connected socket) is
+      // read as such by c-ares's receive.
+      const bool readable = (watched[i].revents & ~POLLOUT) != 0;
+      const bool writable = (watched[i].revents & POLLOUT) != 0;
+      ares_process_fd(owners[i]->channel.get(),
+                      readable ? watched[i].fd : ARES_SOCKET_BAD,
+                      writable ? watched[i].fd : ARES_SOCKET_BAD);
+      served.push_back(owners[i]);
     }
-    return heard;
+    for (Query *query : pending) {
+      if (std::find(served.begin(), served.end(), query) == served.end()) {
+        // Nothing to read: c-ares only resends or gives up what is due.
+        ares_process_fd(query->channel.get(), ARES_SOCKET_BAD, ARES_SOCKET_BAD);
+      }
+    }
+    return true;
   }
 
   DnsClientOptions mOptions;
@@ -397,82 +365,100 @@ std::vector<std::string> ParseResolvConf(std::string_view text) {
   return servers;
 }
 
-std::vector<uint8_t> BuildDnsQuery(uint16_t id, std::string_view name) {
-  std::optional<std::vector<std::string_view>> labels = Labels(name);
-  if (!labels) {
-    return {};
+bool IsValidDnsName(std::string_view name) {
+  if (!name.empty() && name.back() == '.') {
+    name.remove_suffix(1);
   }
-  std::vector<uint8_t> packet = {
-      static_cast<uint8_t>(id >> 8),
-      static_cast<uint8_t>(id & 0xFF),
-      static_cast<uint8_t>(kFlagRecursionDesired >> 8),
-      0,
-      0,
-      1, // one question
-      0,
-      0,
-      0,
-      0,
-      0,
-      0,
-  };
-  for (std::string_view label : *labels) {
-    packet.push_back(static_cast<uint8_t>(label.size()));
-    packet.insert(packet.end(), label.begin(), label.end());
+  if (name.empty() || name.size() > kMaxNameText) {
+    return false;
   }
-  packet.push_back(0);
-  packet.push_back(0);
-  packet.push_back(kTypeA);
-  packet.push_back(0);
-  packet.push_back(kClassIn);
-  return packet;
+  for (;;) {
+    const std::size_t dot = name.find('.');
+    const std::string_view label = name.substr(0, dot);
+    if (label.empty() || label.size() > kMaxLabel ||
+        std::any_of(label.begin(), label.end(), [](char c) {
+          return static_cast<unsigned char>(c) <= 0x20 ||
+                 static_cast<unsigned char>(c) >= 0x7F;
+        })) {
+      return false;
+    }
+    if (dot == std::string_view::npos) {
+      return true;
+    }
+    name.remove_prefix(dot + 1);
+  }
 }
 
-std::optional<DnsReply> ParseDnsReply(std::span<const uint8_t> bytes,
-                                      uint16_t id, std::string_view name) {
-  if (bytes.size() < kHeaderBytes || Get16(bytes, 0) != id) {
-    return std::nullopt;
+DnsLookup ReadDnsAnswer(std::string_view server, int status,
+                        std::span<const uint8_t> reply) {
+  DnsLookup heard;
+  heard.server = std::string(server);
+  heard.rcode = ReplyRcode(status, reply);
+  if (status == ARES_SUCCESS && heard.rcode != ns_r_noerror) {
+    // An RCODE that ares_query does not name (6..15) is still an error.
+    status = ARES_ESERVFAIL;
   }
-  const uint16_t flags = Get16(bytes, 2);
-  if ((flags & kFlagResponse) == 0 || (flags & kOpcodeMask) != 0 ||
-      Get16(bytes, 4) != 1) {
-    return std::nullopt;
-  }
-  DnsReply reply;
-  reply.rcode = flags & kRcodeMask;
-  reply.truncated = (flags & kFlagTruncated) != 0;
-  const uint16_t answers = Get16(bytes, 6);
-
-  std::size_t offset = kHeaderBytes;
-  std::string asked;
-  if (!ReadName(bytes, offset, asked) || asked != Lower(name) ||
-      offset + 4 > bytes.size() || Get16(bytes, offset) != kTypeA ||
-      Get16(bytes, offset + 2) != kClassIn) {
-    return std::nullopt;
-  }
-  offset += 4;
-  for (uint16_t i = 0; i < answers; ++i) {
-    std::string owner;
-    if (!ReadName(bytes, offset, owner) || offset + 10 > bytes.size()) {
-      break; // a truncated answer section: keep what was whole
+  int parsed = status;
+  if (status == ARES_SUCCESS) {
+    std::array<ares_addrttl, kMaxAddresses> records{};
+    int count = kMaxAddresses;
+    parsed = ares_parse_a_reply(reply.data(), static_cast<int>(reply.size()),
+                                nullptr, records.data(), &count);
+    if (parsed == ARES_EBADNAME) {
+      parsed = ARES_EBADRESP; // a name in the reply that cannot be read
     }
-    const uint16_t type = Get16(bytes, offset);
-    const uint16_t klass = Get16(bytes, offset + 2);
-    const uint16_t length = Get16(bytes, offset + 8);
-    offset += 10;
-    if (offset + length > bytes.size()) {
-      break;
+    if (parsed == ARES_SUCCESS) {
+      for (int i = 0; i < count; ++i) {
+        heard.addresses.push_back(
+            ntohl(records[static_cast<std::size_t>(i)].ipaddr.s_addr));
+      }
     }
-    ++reply.answerRecords;
-    if (type == kTypeA && klass == kClassIn && length == 4) {
-      reply.addresses.push_back((uint32_t{bytes[offset]} << 24) |
-                                (uint32_t{bytes[offset + 1]} << 16) |
-                                (uint32_t{bytes[offset + 2]} << 8) |
-                                uint32_t{bytes[offset + 3]});
-    }
-    offset += length;
   }
-  return reply;
+  switch (parsed) {
+  case ARES_SUCCESS:
+  case ARES_ENODATA:
+  case ARES_EBADRESP:
+    if (!heard.addresses.empty()) {
+      heard.outcome = DnsOutcome::kAnswered;
+      heard.why =
+          heard.server + " answered " + FormatIpv4(heard.addresses.front());
+    } else {
+      heard.outcome = DnsOutcome::kNoAddress;
+      heard.why = heard.server + " answered without an address";
+      if (parsed == ARES_EBADRESP) {
+        heard.why += std::string(" (") + ares_strerror(parsed) + ")";
+      }
+    }
+    break;
+  case ARES_ENOTFOUND:
+    heard.outcome = DnsOutcome::kNameError;
+    heard.why = heard.server + " answered that the name does not exist";
+    break;
+  case ARES_EFORMERR:
+  case ARES_ESERVFAIL:
+  case ARES_ENOTIMP:
+  case ARES_EREFUSED:
+    heard.outcome = DnsOutcome::kServerError;
+    heard.why =
+        heard.server + " answered with error " + std::to_string(heard.rcode);
+    break;
+  case ARES_ECONNREFUSED:
+    // c-ares's sockets are connected: an ICMP "port unreachable" for both
+    // tries (or a send that failed) ends the query with this.
+    heard.outcome = DnsOutcome::kServerError;
+    heard.why = heard.server + ": " + ErrnoText(ECONNREFUSED);
+    break;
+  case ARES_ETIMEOUT:
+  case ARES_ECANCELLED:
+    heard.outcome = DnsOutcome::kNoAnswer;
+    heard.why = heard.server + " did not answer";
+    break;
+  default:
+    heard.outcome = DnsOutcome::kFailed;
+    heard.why = heard.server + ": " + ares_strerror(parsed);
+    break;
+  }
+  return heard;
 }
 
 const char *DnsOutcomeName(DnsOutcome outcome) {

@@ -1,10 +1,10 @@
 // The fifth check of router detection: a name server is configured in
 // /etc/resolv.conf and answers a lookup of a configured name
 // ("dns_probe_name" in the library configuration) with an address. The
-// lookup is a DNS query of our own over UDP (RFC 1035), sent to every
-// configured server at once, so that its time is bounded to the
-// millisecond; the system resolver's timeouts are whole seconds per server
-// and try.
+// lookup goes through c-ares to exactly the servers read from
+// /etc/resolv.conf, every one asked at once on a channel of its own, so
+// that its time is bounded to the millisecond; the system resolver's
+// timeouts are whole seconds per server and try.
 #ifndef ZARK_PORTMAP_DNS_PROBE_H
 #define ZARK_PORTMAP_DNS_PROBE_H
 
@@ -32,13 +32,15 @@ inline constexpr std::size_t kMaxNameServers = 3;
 // Pure.
 [[nodiscard]] std::vector<std::string> ParseResolvConf(std::string_view text);
 
-// A standard query (recursion desired) for the A record of name. Empty when
-// name is not a valid name: labels of 1..63 bytes of printable characters,
-// 253 at most in all, one trailing dot allowed. Pure.
-[[nodiscard]] std::vector<uint8_t> BuildDnsQuery(uint16_t id,
-                                                 std::string_view name);
+// Whether name may be looked up: labels of 1..63 bytes of printable
+// characters (no space), 253 at most in all, one trailing dot allowed.
+// c-ares would put any bytes on the wire; a configured name with a space
+// in it is a mistake to report, not to send. Pure.
+[[nodiscard]] bool IsValidDnsName(std::string_view name);
 
-// DNS reply codes (RCODE) acted on, from RFC 1035.
+// DNS reply codes (RCODE) acted on, from RFC 1035 (checked against
+// <arpa/nameser.h>'s ns_r_* in dns_probe.cpp, which this header keeps out
+// of its includers for the macros it brings).
 enum DnsRcode : int {
   kDnsNoError = 0,
   kDnsFormatError = 1,
@@ -48,27 +50,12 @@ enum DnsRcode : int {
   kDnsRefused = 5,
 };
 
-struct DnsReply {
-  int rcode = 0;
-  bool truncated = false;
-  int answerRecords = 0;           // records in the answer section read
-  std::vector<uint32_t> addresses; // its A records, host byte order
-};
-
-// Reads a reply to BuildDnsQuery(id, name). Nothing when bytes are not
-// such a reply: too short, not a response, another id, another question,
-// or malformed (names running past the end, compression pointers that do
-// not point backwards, more than 16 of them). The answer section is read
-// as far as it is whole. Pure.
-[[nodiscard]] std::optional<DnsReply>
-ParseDnsReply(std::span<const uint8_t> bytes, uint16_t id,
-              std::string_view name);
-
 enum class DnsOutcome {
   kAnswered,    // a server answered with at least one address
-  kNoAddress,   // answered "no error" without an A record
+  kNoAddress,   // answered "no error" without a readable A record
   kNameError,   // answered that the name does not exist
-  kServerError, // answered with another error (refused, server failure)
+  kServerError, // answered with another error (refused, server failure), or
+                // could not be reached (connection refused)
   kNoAnswer,    // nothing answered within the budget
   kFailed,      // nothing could be sent (logged)
 };
@@ -79,9 +66,25 @@ struct DnsLookup {
   DnsOutcome outcome = DnsOutcome::kNoAnswer;
   std::string server; // the server whose answer this is
   int rcode = 0;
-  std::vector<uint32_t> addresses;
-  std::string why; // one line for the log
+  std::vector<uint32_t> addresses; // host byte order
+  std::string why;                 // one line for the log
 };
+
+// What server's reply to the A query says, from the status c-ares hands
+// the query's callback (ares_query: ARES_SUCCESS, ARES_ENODATA,
+// ARES_ENOTFOUND, ARES_ESERVFAIL, ARES_EREFUSED, ARES_EFORMERR,
+// ARES_ENOTIMP, ARES_ETIMEOUT, ARES_ECONNREFUSED, ...) and the reply's
+// bytes (empty when c-ares has none). The addresses are read with
+// ares_parse_a_reply, CNAME chains followed:
+//   ARES_SUCCESS with an A record       kAnswered, its addresses
+//   ARES_SUCCESS without a readable one kNoAddress (also ARES_ENODATA)
+//   ARES_ENOTFOUND                      kNameError, rcode 3
+//   another RCODE, ARES_ECONNREFUSED    kServerError
+//   ARES_ETIMEOUT, ARES_ECANCELLED      kNoAnswer
+//   anything else                       kFailed
+// Pure.
+[[nodiscard]] DnsLookup ReadDnsAnswer(std::string_view server, int status,
+                                      std::span<const uint8_t> reply);
 
 class DnsClient {
 public:
@@ -97,11 +100,15 @@ public:
 
 struct DnsClientOptions {
   uint16_t port = 53; // tests use another
-  // Servers that have not answered by then are asked once more.
+  // A server that has not answered by then is asked once more
+  // (ARES_OPT_TIMEOUTMS with ARES_OPT_TRIES 2; c-ares doubles the wait for
+  // the second try, so a silent server is given up on after three times
+  // this, or at the budget's end, whichever comes first).
   std::chrono::milliseconds resendAfter{500};
 };
 
-// One connected UDP socket per server; at most two queries per server.
+// One c-ares channel per server, each with that server alone; at most two
+// queries per server, over UDP only.
 [[nodiscard]] std::unique_ptr<DnsClient>
 MakeUdpDnsClient(DnsClientOptions options = {});
 
