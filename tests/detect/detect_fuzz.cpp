@@ -7,6 +7,7 @@
 #include "detect/wan_probe.h"
 #include "net/igd_description.h"
 #include "net/ssdp_search.h"
+#include "net/xml_reader.h"
 
 #include <ares.h>
 #include <arpa/inet.h>
@@ -15,7 +16,9 @@
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
+#include <string>
 #include <string_view>
+#include <vector>
 
 namespace {
 
@@ -35,6 +38,32 @@ bool Printable(std::string_view text) {
   }
   return true;
 }
+
+// ReadXml's promises on its events: every end closes the innermost open
+// element, depths count the open elements and stay within the limit, text
+// lies inside an element, a reference is one character.
+class XmlEventPromises final : public XmlVisitor {
+public:
+  static constexpr std::size_t kMaxDepth = 16;
+
+  bool OnStart(std::string_view name, std::size_t depth) override {
+    Check(depth == mOpen.size() + 1 && depth <= kMaxDepth);
+    mOpen.emplace_back(name);
+    return true;
+  }
+  bool OnEnd(std::string_view name, std::size_t depth) override {
+    Check(depth == mOpen.size() && depth >= 1 && mOpen.back() == name);
+    mOpen.pop_back();
+    return true;
+  }
+  void OnText(std::string_view text, std::size_t depth,
+              bool fromReference) override {
+    Check(depth == mOpen.size() && depth >= 1);
+    Check(!fromReference || (!text.empty() && text.size() <= 4));
+  }
+
+  std::vector<std::string> mOpen;
+};
 
 } // namespace
 
@@ -70,6 +99,13 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
       Check(Printable(*field));
       Check(field->empty() || (field->front() != ' ' && field->back() != ' '));
     }
+    XmlEventPromises events;
+    const XmlEnd end =
+        ReadXml(text, events,
+                XmlLimits{.maxBytes = kMaxRootDescriptionBytes,
+                          .maxDepth = XmlEventPromises::kMaxDepth});
+    Check(end != XmlEnd::kStopped);
+    Check(end != XmlEnd::kComplete || events.mOpen.empty());
     break;
   }
   case 3: {

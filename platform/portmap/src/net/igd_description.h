@@ -34,10 +34,16 @@ struct IgdIdentity {
 //       <modelName>TestIGD</modelName><modelNumber>1</modelNumber>
 //       <deviceList><device>...embedded devices, not read...</device>
 //
-// Namespace prefixes are ignored, entities and CDATA decoded, blanks
-// trimmed, control characters turned into blanks, each text cut to
-// kMaxIdentityText bytes. Missing elements stay empty; text that is not
-// XML gives all three empty. Pure.
+// Read with expat (net/xml_reader.h): namespace prefixes are ignored,
+// entities and CDATA decoded, undeclared entities kept as written,
+// characters written as references beyond printable ASCII shown as "?",
+// blanks trimmed, control characters turned into blanks, each text cut to
+// kMaxIdentityText bytes. Only the first of a repeated element counts.
+// Missing elements stay empty. Reading ends at the end of the root device,
+// at the first fault of a document that is not well-formed (what was
+// whole before it is kept), at a DOCTYPE, at nesting deeper than 64
+// elements; a text longer than kMaxRootDescriptionBytes gives all three
+// empty, and so does text that is not XML. Pure.
 [[nodiscard]] IgdIdentity ParseIgdIdentity(std::string_view xml);
 
 // GETs the root description at url (http:// only), at most
