@@ -156,6 +156,22 @@ private:
   bool ConnectionOpen();
   void CleanUp();
 
+  // The steps of Init; false when the test ends there (mError set).
+  bool ChooseUpnpRouter();
+  bool MakeProbeAndFindClient();
+  // The TCP ports the user's rules hold on this router, into taken, and
+  // where the router was found before, into memo.
+  void ReadMappingState(std::set<uint16_t> &taken, RouterRecord &memo);
+  bool OpenRouter(RouterRecord &memo);
+  // The TCP ports the router already maps, into taken.
+  void ReadRouterTable(std::set<uint16_t> &taken);
+  // The ports from mEnv.firstPort on that are not taken, as many as the
+  // test may need.
+  [[nodiscard]] std::vector<uint16_t>
+  FreePorts(const std::set<uint16_t> &taken) const;
+  // The connection-check port and the fill candidates after it.
+  bool ChooseTestPorts(const std::vector<uint16_t> &free);
+
   // Ends the test at stage key (marked failedText) with error and reason.
   bool Fail(const char *stage, const std::string &failedText, int error,
             const std::string &reason);
@@ -269,7 +285,7 @@ ProbeAnswer CompatibilityTest::Probe() {
   return mProbe->Check(IpProtocol::kTcp, mConnectionPort, mListener.Token());
 }
 
-bool CompatibilityTest::Init() {
+bool CompatibilityTest::ChooseUpnpRouter() {
   std::optional<std::string> gateway = mEnv.gateway();
   if (!gateway) {
     return Fail(key::kInit, value::kFailed, ZARK_UPNP_TEST_ERR_INIT,
@@ -295,6 +311,10 @@ bool CompatibilityTest::Init() {
                     ", not UPnP");
   }
   mHaveConf = mEnv.routerConf && mEnv.routerConf(mGateway, mConf);
+  return true;
+}
+
+bool CompatibilityTest::MakeProbeAndFindClient() {
   std::string why;
   mProbe = mEnv.makeProbe ? mEnv.makeProbe(why, [this] { return StopAsked(); })
                           : nullptr;
@@ -309,35 +329,31 @@ bool CompatibilityTest::Init() {
   }
   mClient = *client;
   mRun.client = mClient;
+  return true;
+}
 
-  // Ports the user's rules hold on this router are never touched.
-  std::set<uint16_t> taken;
+void CompatibilityTest::ReadMappingState(std::set<uint16_t> &taken,
+                                         RouterRecord &memo) {
   MappingState state;
-  // Where the router was found before, and finite leases: should the
-  // test's own cleanup and every later one fail, its mappings still run
-  // out within the hour (a router that takes only permanent ones gets
-  // those, after its 725).
-  RouterRecord memo;
-  memo.gateway = mGateway;
-  memo.protocol = RouterProtocol::kUpnp;
-  if (LoadMappingState(mEnv.mappingStatePath, state)) {
-    for (const RouterRecord &record : state.routers) {
-      if (record.gateway != mGateway) {
-        continue;
-      }
-      if (record.protocol == RouterProtocol::kUpnp) {
-        memo.location = record.location;
-      }
-      for (const RecordedMapping &mapping : record.mappings) {
-        if (mapping.protocol == IpProtocol::kTcp) {
-          taken.insert(mapping.externalPort);
-        }
+  if (!LoadMappingState(mEnv.mappingStatePath, state)) {
+    return;
+  }
+  for (const RouterRecord &record : state.routers) {
+    if (record.gateway != mGateway) {
+      continue;
+    }
+    if (record.protocol == RouterProtocol::kUpnp) {
+      memo.location = record.location;
+    }
+    for (const RecordedMapping &mapping : record.mappings) {
+      if (mapping.protocol == IpProtocol::kTcp) {
+        taken.insert(mapping.externalPort);
       }
     }
   }
-  if (MustStop(key::kInit, value::kFailed)) {
-    return false;
-  }
+}
+
+bool CompatibilityTest::OpenRouter(RouterRecord &memo) {
   memo.finiteLeases = true;
   mRouter = mEnv.makeRouter(RouterProtocol::kUpnp, mGateway, &memo);
   if (mRouter == nullptr) {
@@ -351,8 +367,10 @@ bool CompatibilityTest::Init() {
   }
   mRun.location = mRouter->Location();
   Note("using the UPnP service at " + mRun.location + " for " + mClient);
+  return true;
+}
 
-  // And neither are the ports the router already maps for anyone.
+void CompatibilityTest::ReadRouterTable(std::set<uint16_t> &taken) {
   std::vector<RouterMapping> entries;
   RouterResult listed = mRouter->ListMappings(entries);
   if (listed.Ok()) {
@@ -367,7 +385,10 @@ bool CompatibilityTest::Init() {
     Note("the router's table cannot be listed (" + listed.message +
          "); ports found taken are skipped on the way");
   }
+}
 
+std::vector<uint16_t>
+CompatibilityTest::FreePorts(const std::set<uint16_t> &taken) const {
   std::vector<uint16_t> free;
   const std::size_t wanted =
       static_cast<std::size_t>(mMax) + kSparePorts + kListenerTries;
@@ -377,6 +398,10 @@ bool CompatibilityTest::Init() {
       free.push_back(static_cast<uint16_t>(port));
     }
   }
+  return free;
+}
+
+bool CompatibilityTest::ChooseTestPorts(const std::vector<uint16_t> &free) {
   // The connection-check port: the first free one this server can listen
   // on.
   std::size_t first = 0;
@@ -398,6 +423,34 @@ bool CompatibilityTest::Init() {
   }
   mCandidates.assign(free.begin() + static_cast<std::ptrdiff_t>(first) + 1,
                      free.end());
+  return true;
+}
+
+bool CompatibilityTest::Init() {
+  if (!ChooseUpnpRouter() || !MakeProbeAndFindClient()) {
+    return false;
+  }
+  // Ports the user's rules hold on this router are never touched.
+  std::set<uint16_t> taken;
+  // Where the router was found before, and finite leases: should the
+  // test's own cleanup and every later one fail, its mappings still run
+  // out within the hour (a router that takes only permanent ones gets
+  // those, after its 725).
+  RouterRecord memo;
+  memo.gateway = mGateway;
+  memo.protocol = RouterProtocol::kUpnp;
+  ReadMappingState(taken, memo);
+  if (MustStop(key::kInit, value::kFailed)) {
+    return false;
+  }
+  if (!OpenRouter(memo)) {
+    return false;
+  }
+  // And neither are the ports the router already maps for anyone.
+  ReadRouterTable(taken);
+  if (!ChooseTestPorts(FreePorts(taken))) {
+    return false;
+  }
   // Everything the test may map is listed before the first request, so
   // that a killed test can be cleaned up after.
   mRun.ports.push_back(mConnectionPort);
