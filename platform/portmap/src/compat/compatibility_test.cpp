@@ -171,6 +171,11 @@ private:
   FreePorts(const std::set<uint16_t> &taken) const;
   // The connection-check port and the fill candidates after it.
   bool ChooseTestPorts(const std::vector<uint16_t> &free);
+  // The steps of Fill: adds the candidates until the router's table is
+  // full or mMax is reached, then reads every confirmed one back; false
+  // when the test ends there (mError set).
+  bool AddUntilFull();
+  bool CheckAddedStillHeld();
 
   // Ends the test at stage key (marked failedText) with error and reason.
   bool Fail(const char *stage, const std::string &failedText, int error,
@@ -490,8 +495,7 @@ bool CompatibilityTest::AddFirst() {
   return true;
 }
 
-bool CompatibilityTest::Fill() {
-  mStage = key::kMax;
+bool CompatibilityTest::AddUntilFull() {
   int conflicts = 0;
   std::string limit;
   for (uint16_t port : mCandidates) {
@@ -544,8 +548,10 @@ bool CompatibilityTest::Fill() {
   } else if (mReached < mMax) {
     Note("no more free ports to map after " + std::to_string(mReached));
   }
+  return true;
+}
 
-  // Does the router still hold every mapping it confirmed?
+bool CompatibilityTest::CheckAddedStillHeld() {
   int dropped = 0;
   for (uint16_t port : mAdded) {
     if (MustStop(key::kMax, "-1")) {
@@ -567,6 +573,18 @@ bool CompatibilityTest::Fill() {
                 "the router dropped " + std::to_string(dropped) + " of the " +
                     std::to_string(mAdded.size()) +
                     " mappings it had confirmed");
+  }
+  return true;
+}
+
+bool CompatibilityTest::Fill() {
+  mStage = key::kMax;
+  if (!AddUntilFull()) {
+    return false;
+  }
+  // Does the router still hold every mapping it confirmed?
+  if (!CheckAddedStillHeld()) {
+    return false;
   }
   mProgress.Set(key::kMax, std::to_string(mReached));
   Note("the router holds all " + std::to_string(mReached) + " mapping(s)");
