@@ -176,6 +176,14 @@ private:
   // when the test ends there (mError set).
   bool AddUntilFull();
   bool CheckAddedStillHeld();
+  // The steps of Run. MappingCountValid and StartFiles set mResult.error
+  // when they return false; RunStages is true when every stage passed;
+  // Finish cleans up and writes the report; Conclude fills mResult.
+  bool MappingCountValid();
+  bool StartFiles();
+  bool RunStages();
+  void Finish();
+  int Conclude(bool passed);
 
   // Ends the test at stage key (marked failedText) with error and reason.
   bool Fail(const char *stage, const std::string &failedText, int error,
@@ -821,13 +829,84 @@ void CompatibilityTest::WriteReport() {
   }
 }
 
-int CompatibilityTest::Run() {
-  mResult = ZARK_ROUTER_TEST_COMPATIBILITY_RESULT{};
+bool CompatibilityTest::MappingCountValid() {
   if (mMax < 1 || mMax > kMaxUpnpTestMappings) {
     ZARK_PM_LOG_ERROR("UPnP compatibility test: %d mappings asked; 1 to %d "
                       "can be tested",
                       mMax, kMaxUpnpTestMappings);
     mResult.error = ZARK_PORTMAP_ERR_BAD_PARAMETER;
+    return false;
+  }
+  return true;
+}
+
+bool CompatibilityTest::StartFiles() {
+  // A stop asked of an earlier test must not end this one, and what a
+  // killed test left on the router goes first.
+  RemoveFile(mEnv.stopPath);
+  if (!CleanUpEarlierUpnpTest(mEnv)) {
+    ZARK_PM_LOG_ERROR("UPnP compatibility test: mappings of an earlier test "
+                      "are still on the router");
+  }
+  mRun.runId = NewProbeToken();
+  mRun.pid = static_cast<long>(::getpid());
+  if (mRun.runId.empty() || !mProgress.Start() || !SaveRunFile()) {
+    ZARK_PM_LOG_ERROR("UPnP compatibility test: cannot start its files");
+    mResult.error = ZARK_PORTMAP_ERR_GENERIC;
+    return false;
+  }
+  return true;
+}
+
+bool CompatibilityTest::RunStages() {
+  try {
+    return Init() && AddFirst() && Fill() && DeleteAll() &&
+           ConnectionClosed() && Readd() && ConnectionOpen();
+  } catch (const std::exception &e) {
+    // Ends the stage under way; the cleanup after still runs.
+    Fail(mStage, std::strcmp(mStage, key::kMax) == 0 ? "-1" : value::kFailed,
+         ZARK_PORTMAP_ERR_GENERIC, std::string("internal error: ") + e.what());
+  }
+  return false;
+}
+
+void CompatibilityTest::Finish() {
+  try {
+    CleanUp();
+  } catch (const std::exception &e) {
+    ZARK_PM_LOG_ERROR("UPnP compatibility test: cleaning up: %s", e.what());
+    Fail(key::kDelete, value::kFailed, ZARK_UPNP_TEST_ERR_DELETE,
+         std::string("cleaning up: ") + e.what());
+  }
+  if (mRouter == nullptr) {
+    RemoveFile(mEnv.runPath);
+  }
+  mProgress.Set(key::kTerminal, value::kFinished);
+  RemoveFile(mEnv.stopPath);
+  WriteReport();
+}
+
+int CompatibilityTest::Conclude(bool passed) {
+  if (!passed || mError != ZARK_PORTMAP_ERR_NONE) {
+    mResult.error =
+        mError != ZARK_PORTMAP_ERR_NONE ? mError : ZARK_PORTMAP_ERR_GENERIC;
+    Note("ended: failed (error " + std::to_string(mResult.error) + ")");
+    Report(mResult.progress);
+    return -1;
+  }
+  CopyText(mResult.record.brand, mHaveConf ? Field(mConf.brand) : "");
+  CopyText(mResult.record.model, mHaveConf ? Field(mConf.model) : "");
+  CopyText(mResult.record.version, mHaveConf ? Field(mConf.version) : "");
+  CopyText(mResult.record.date, UtcDateText(mEnv.now()));
+  mResult.record.max_mappings = mReached;
+  Note("ended: success, " + std::to_string(mReached) + " mapping(s)");
+  Report(100);
+  return 0;
+}
+
+int CompatibilityTest::Run() {
+  mResult = ZARK_ROUTER_TEST_COMPATIBILITY_RESULT{};
+  if (!MappingCountValid()) {
     return -1;
   }
   RunningTaskMark mark(ZARK_PORTMAP_TASK_UPNP_TEST, mEnv.runningTaskPath);
@@ -847,60 +926,14 @@ int CompatibilityTest::Run() {
     mResult.error = ZARK_PORTMAP_ERR_GENERIC;
     return -1;
   }
-  // A stop asked of an earlier test must not end this one, and what a
-  // killed test left on the router goes first.
-  RemoveFile(mEnv.stopPath);
-  if (!CleanUpEarlierUpnpTest(mEnv)) {
-    ZARK_PM_LOG_ERROR("UPnP compatibility test: mappings of an earlier test "
-                      "are still on the router");
-  }
-  mRun.runId = NewProbeToken();
-  mRun.pid = static_cast<long>(::getpid());
-  if (mRun.runId.empty() || !mProgress.Start() || !SaveRunFile()) {
-    ZARK_PM_LOG_ERROR("UPnP compatibility test: cannot start its files");
-    mResult.error = ZARK_PORTMAP_ERR_GENERIC;
+  if (!StartFiles()) {
     return -1;
   }
   Report(0);
   Note("started: up to " + std::to_string(mMax) + " mapping(s)");
-
-  bool passed = false;
-  try {
-    passed = Init() && AddFirst() && Fill() && DeleteAll() &&
-             ConnectionClosed() && Readd() && ConnectionOpen();
-  } catch (const std::exception &e) {
-    // Ends the stage under way; the cleanup below still runs.
-    Fail(mStage, std::strcmp(mStage, key::kMax) == 0 ? "-1" : value::kFailed,
-         ZARK_PORTMAP_ERR_GENERIC, std::string("internal error: ") + e.what());
-  }
-  try {
-    CleanUp();
-  } catch (const std::exception &e) {
-    ZARK_PM_LOG_ERROR("UPnP compatibility test: cleaning up: %s", e.what());
-    Fail(key::kDelete, value::kFailed, ZARK_UPNP_TEST_ERR_DELETE,
-         std::string("cleaning up: ") + e.what());
-  }
-  if (mRouter == nullptr) {
-    RemoveFile(mEnv.runPath);
-  }
-  mProgress.Set(key::kTerminal, value::kFinished);
-  RemoveFile(mEnv.stopPath);
-  WriteReport();
-  if (!passed || mError != ZARK_PORTMAP_ERR_NONE) {
-    mResult.error =
-        mError != ZARK_PORTMAP_ERR_NONE ? mError : ZARK_PORTMAP_ERR_GENERIC;
-    Note("ended: failed (error " + std::to_string(mResult.error) + ")");
-    Report(mResult.progress);
-    return -1;
-  }
-  CopyText(mResult.record.brand, mHaveConf ? Field(mConf.brand) : "");
-  CopyText(mResult.record.model, mHaveConf ? Field(mConf.model) : "");
-  CopyText(mResult.record.version, mHaveConf ? Field(mConf.version) : "");
-  CopyText(mResult.record.date, UtcDateText(mEnv.now()));
-  mResult.record.max_mappings = mReached;
-  Note("ended: success, " + std::to_string(mReached) + " mapping(s)");
-  Report(100);
-  return 0;
+  const bool passed = RunStages();
+  Finish();
+  return Conclude(passed);
 }
 
 // Marks the stage a killed test left "processing" as failed, so that a
