@@ -86,6 +86,23 @@ private:
   void RunDeletions(RouterDriver &router);
   void RunStaleDeletions();
   void RunAdditions(RouterDriver &router);
+  // What asking the router about a kCheck step found.
+  enum class Checked { kHeld, kMoved, kAddAgain, kRouterGone };
+  Checked CheckStillHeld(RouterDriver &router, const Step &step,
+                         const std::string &where);
+  // Adds the step's mapping and records the router's answer; where names
+  // the rule and port in messages.
+  void AddMapping(RouterDriver &router, const Step &step,
+                  const std::string &where);
+  void OnAddConflict(RouterDriver &router, const Step &step,
+                     const std::string &where, const RouterResult &added);
+  void OnAddTableFull(const Step &step, const std::string &where,
+                      const RouterResult &added);
+  void OnAddRefused(const Step &step, const std::string &where,
+                    const RouterResult &added);
+  // Writes the state file when the last write is older than the interval,
+  // so that a killed job leaves its progress recorded.
+  void SaveStateNowAndThen();
   void RecordAdded(const Step &step, const RouterResult &added);
   void PutBackUnattempted();
   [[nodiscard]] RouterRecord &Record() { return mState.routers[mRecordIndex]; }
@@ -343,6 +360,123 @@ void Applier::RecordAdded(const Step &step, const RouterResult &added) {
   Record().Put(entry);
 }
 
+Applier::Checked Applier::CheckStillHeld(RouterDriver &router, const Step &step,
+                                         const std::string &where) {
+  const Key key = step.PortKey();
+  ++mSummary->operations;
+  RouterMapping entry;
+  RouterResult checked =
+      router.GetSpecificPortMapping(key.first, key.second, entry);
+  if (checked.Ok()) {
+    ++mSummary->checked;
+    if (entry.internalClient == step.mapping.internalClient &&
+        entry.internalPort == step.mapping.internalPort) {
+      RouterResult held;
+      held.outcome = RouterOutcome::kOk;
+      held.leaseSeconds = entry.leaseSeconds;
+      RecordAdded(step, held);
+      return Checked::kHeld;
+    }
+    ++mSummary->failed;
+    Record().Remove(key.first, key.second);
+    Fail(kSaveErrRouter, where + " now goes to " + entry.internalClient + ":" +
+                             std::to_string(entry.internalPort) +
+                             " on the router");
+    return Checked::kMoved;
+  }
+  if (IsRouterGone(checked.outcome)) {
+    Fail(kSaveErrRouter, checked.message);
+    mAborted = true;
+    return Checked::kRouterGone;
+  }
+  // Not found, not understood, or not askable (NAT-PMP): add it again;
+  // until the router answers, it is not known to be there.
+  if (RecordedMapping *recorded = Record().Find(key.first, key.second)) {
+    recorded->held = false;
+  }
+  return Checked::kAddAgain;
+}
+
+void Applier::AddMapping(RouterDriver &router, const Step &step,
+                         const std::string &where) {
+  ++mSummary->operations;
+  RouterResult added = router.AddPortMapping(step.mapping);
+  switch (added.outcome) {
+  case RouterOutcome::kOk:
+    ++mSummary->added;
+    RecordAdded(step, added);
+    break;
+  case RouterOutcome::kConflict:
+    OnAddConflict(router, step, where, added);
+    break;
+  case RouterOutcome::kNotHeld:
+    OnAddTableFull(step, where, added);
+    break;
+  case RouterOutcome::kRefused:
+  case RouterOutcome::kNotFound:
+  case RouterOutcome::kUnsupported:
+    OnAddRefused(step, where, added);
+    break;
+  case RouterOutcome::kBadReply:
+    // It may or may not be there: stays "not known to be held".
+    ++mSummary->failed;
+    Fail(kSaveErrRouter, where + ": " + added.message);
+    break;
+  case RouterOutcome::kNoAnswer:
+  case RouterOutcome::kNoRouter:
+  case RouterOutcome::kFailed:
+    Fail(kSaveErrRouter, where + ": " + added.message);
+    mAborted = true;
+    break;
+  }
+}
+
+void Applier::OnAddConflict(RouterDriver &router, const Step &step,
+                            const std::string &where,
+                            const RouterResult &added) {
+  const Key key = step.PortKey();
+  ++mSummary->failed;
+  Record().Remove(key.first, key.second);
+  Fail(kSaveErrRouter, where + " is taken on the router: " + added.message);
+  // NAT-PMP granted another port: give it back unless it is one of ours.
+  uint16_t granted = added.grantedExternalPort;
+  if (granted == 0 || mWantedKeys.count({key.first, granted}) != 0 ||
+      Record().Find(key.first, granted) != nullptr) {
+    return;
+  }
+  PortMapping extra = step.mapping;
+  extra.externalPort = granted;
+  ++mSummary->operations;
+  RouterResult returned = router.DeletePortMapping(extra);
+  if (!returned.Ok()) {
+    ZARK_PM_LOG_ERROR("cannot give back %s: %s",
+                      PortText(key.first, granted).c_str(),
+                      returned.message.c_str());
+  }
+}
+
+void Applier::OnAddTableFull(const Step &step, const std::string &where,
+                             const RouterResult &added) {
+  // The router's table is full: further adds would be dropped too.
+  OnAddRefused(step, where, added);
+  mAborted = true;
+}
+
+void Applier::OnAddRefused(const Step &step, const std::string &where,
+                           const RouterResult &added) {
+  ++mSummary->failed;
+  Record().Remove(step.mapping.protocol, step.mapping.externalPort);
+  Fail(kSaveErrRouter, where + ": " + added.message);
+}
+
+void Applier::SaveStateNowAndThen() {
+  if (!mAborted && Clock::now() - mLastStateSave >= mEnv.stateSaveInterval &&
+      !SaveMappingState(mEnv.statePath, mState)) {
+    // Logged; the final write decides the result.
+    mLastStateSave = Clock::now();
+  }
+}
+
 void Applier::RunAdditions(RouterDriver &router) {
   const int total = static_cast<int>(mAdditions.size());
   int done = 0;
@@ -357,109 +491,22 @@ void Applier::RunAdditions(RouterDriver &router) {
       break;
     }
     step.attempted = true;
-    const Key key = step.PortKey();
-    const std::string where = "rule \"" + step.ruleId + "\", router port " +
-                              PortText(key.first, key.second);
-    bool add = true;
+    const std::string where =
+        "rule \"" + step.ruleId + "\", router port " +
+        PortText(step.mapping.protocol, step.mapping.externalPort);
+    Checked checked = Checked::kAddAgain;
     if (step.kind == Step::Kind::kCheck) {
-      ++mSummary->operations;
-      RouterMapping entry;
-      RouterResult checked =
-          router.GetSpecificPortMapping(key.first, key.second, entry);
-      if (checked.Ok()) {
-        ++mSummary->checked;
-        if (entry.internalClient == step.mapping.internalClient &&
-            entry.internalPort == step.mapping.internalPort) {
-          RouterResult held;
-          held.outcome = RouterOutcome::kOk;
-          held.leaseSeconds = entry.leaseSeconds;
-          RecordAdded(step, held);
-          add = false;
-        } else {
-          ++mSummary->failed;
-          Record().Remove(key.first, key.second);
-          Fail(kSaveErrRouter, where + " now goes to " + entry.internalClient +
-                                   ":" + std::to_string(entry.internalPort) +
-                                   " on the router");
-          add = false;
-        }
-      } else if (IsRouterGone(checked.outcome)) {
-        Fail(kSaveErrRouter, checked.message);
-        mAborted = true;
+      checked = CheckStillHeld(router, step, where);
+      if (checked == Checked::kRouterGone) {
         break;
-      }
-      // Not found, not understood, or not askable (NAT-PMP): add it again;
-      // until the router answers, it is not known to be there.
-      if (add) {
-        if (RecordedMapping *recorded = Record().Find(key.first, key.second)) {
-          recorded->held = false;
-        }
       }
     }
-    if (add) {
-      ++mSummary->operations;
-      RouterResult added = router.AddPortMapping(step.mapping);
-      switch (added.outcome) {
-      case RouterOutcome::kOk:
-        ++mSummary->added;
-        RecordAdded(step, added);
-        break;
-      case RouterOutcome::kConflict: {
-        ++mSummary->failed;
-        Record().Remove(key.first, key.second);
-        Fail(kSaveErrRouter,
-             where + " is taken on the router: " + added.message);
-        // NAT-PMP granted another port: give it back unless it is one of
-        // ours.
-        uint16_t granted = added.grantedExternalPort;
-        if (granted != 0 && mWantedKeys.count({key.first, granted}) == 0 &&
-            Record().Find(key.first, granted) == nullptr) {
-          PortMapping extra = step.mapping;
-          extra.externalPort = granted;
-          ++mSummary->operations;
-          RouterResult returned = router.DeletePortMapping(extra);
-          if (!returned.Ok()) {
-            ZARK_PM_LOG_ERROR("cannot give back %s: %s",
-                              PortText(key.first, granted).c_str(),
-                              returned.message.c_str());
-          }
-        }
-        break;
-      }
-      case RouterOutcome::kNotHeld:
-        // The router's table is full: further adds would be dropped too.
-        ++mSummary->failed;
-        Record().Remove(key.first, key.second);
-        Fail(kSaveErrRouter, where + ": " + added.message);
-        mAborted = true;
-        break;
-      case RouterOutcome::kRefused:
-      case RouterOutcome::kNotFound:
-      case RouterOutcome::kUnsupported:
-        ++mSummary->failed;
-        Record().Remove(key.first, key.second);
-        Fail(kSaveErrRouter, where + ": " + added.message);
-        break;
-      case RouterOutcome::kBadReply:
-        // It may or may not be there: stays "not known to be held".
-        ++mSummary->failed;
-        Fail(kSaveErrRouter, where + ": " + added.message);
-        break;
-      case RouterOutcome::kNoAnswer:
-      case RouterOutcome::kNoRouter:
-      case RouterOutcome::kFailed:
-        Fail(kSaveErrRouter, where + ": " + added.message);
-        mAborted = true;
-        break;
-      }
+    if (checked == Checked::kAddAgain) {
+      AddMapping(router, step, where);
     }
     ++done;
     mProgress.Report("add", done, total);
-    if (!mAborted && Clock::now() - mLastStateSave >= mEnv.stateSaveInterval &&
-        !SaveMappingState(mEnv.statePath, mState)) {
-      // Logged; the final write below decides the result.
-      mLastStateSave = Clock::now();
-    }
+    SaveStateNowAndThen();
   }
 }
 

@@ -253,7 +253,8 @@ bool SwapIn(const std::string &staged, int &err) {
   return true;
 }
 
-bool Update(int &version, int &err) {
+// The configured update source; empty (logged, err set) when there is none.
+std::string UpdateSource(int &err) {
   const std::string source =
       GetLibraryConfig(config_key::kRouterDbUpdateSource, "");
   if (source.empty()) {
@@ -261,29 +262,29 @@ bool Update(int &version, int &err) {
                       std::string(config_key::kRouterDbUpdateSource).c_str(),
                       kLibraryConfigPath);
     err = ZARK_PORTMAP_ERR_BAD_PARAMETER;
-    return false;
   }
-  RouterDbLock updateLock(kRouterDbUpdateLockFile,
-                          RouterDbLock::Mode::kExclusive,
-                          std::chrono::milliseconds(120000));
-  if (!updateLock.Held()) {
-    err = ZARK_PORTMAP_ERR_IO;
-    return false;
-  }
+  return source;
+}
+
+// A fresh staging folder beside the installed database, after removing
+// what an interrupted update left there.
+bool CreateStaging(StagingFolder &staging, int &err) {
   const std::string parent = ParentOf(ZARK_PORTMAP_ROUTERDB_DIR);
   if (!MakeFolders(parent, 0755)) {
     err = ZARK_PORTMAP_ERR_IO;
     return false;
   }
   RemoveStaleStaging(parent);
-  StagingFolder staging;
   if (!staging.Create(parent)) {
     err = ZARK_PORTMAP_ERR_IO;
     return false;
   }
-  const std::string archive = staging.Path() + "/archive";
-  const std::string tree = staging.Path() + "/tree";
-  const std::string staged = tree + "/routerdb";
+  return true;
+}
+
+// Downloads the archive from source to archive and unpacks it into tree.
+bool FetchAndUnpack(const std::string &source, const std::string &archive,
+                    const std::string &tree, int &err) {
   if (!FetchArchive(source, archive, err)) {
     return false;
   }
@@ -296,7 +297,13 @@ bool Update(int &version, int &err) {
     err = ZARK_PORTMAP_ERR_IO;
     return false;
   }
-  RouterDb fetched;
+  return true;
+}
+
+// Reads the unpacked database at staged; false (logged, err set) when it is
+// not valid or holds no router.
+bool ReadFetchedDb(const std::string &source, const std::string &staged,
+                   RouterDb &fetched, int &err) {
   if (!ReadRouterDbAt(staged, fetched, err)) {
     ZARK_PM_LOG_ERROR("router database from %.300s refused; the installed "
                       "one stays",
@@ -310,20 +317,52 @@ bool Update(int &version, int &err) {
     err = ZARK_PORTMAP_ERR_IO;
     return false;
   }
+  return true;
+}
+
+// True, with its version, when the installed database is readable and not
+// older than fetched.
+bool InstalledIsAsNew(const RouterDb &fetched, int &version) {
   RouterDb installed;
   int installedErr = ZARK_PORTMAP_ERR_NONE;
-  {
-    RouterDbLock readLock(kRouterDbLockFile, RouterDbLock::Mode::kShared);
-    // An installed database that cannot be read (or of another syntax) is
-    // replaced by any valid one; ReadRouterDbInfoAt has logged why.
-    if (readLock.Held() &&
-        ReadRouterDbInfoAt(ZARK_PORTMAP_ROUTERDB_DIR, installed,
-                           installedErr) &&
-        installed.version >= fetched.version) {
-      version = installed.version;
-      err = ZARK_PORTMAP_ERR_NONE;
-      return true;
-    }
+  RouterDbLock readLock(kRouterDbLockFile, RouterDbLock::Mode::kShared);
+  // An installed database that cannot be read (or of another syntax) is
+  // replaced by any valid one; ReadRouterDbInfoAt has logged why.
+  if (readLock.Held() &&
+      ReadRouterDbInfoAt(ZARK_PORTMAP_ROUTERDB_DIR, installed, installedErr) &&
+      installed.version >= fetched.version) {
+    version = installed.version;
+    return true;
+  }
+  return false;
+}
+
+bool Update(int &version, int &err) {
+  const std::string source = UpdateSource(err);
+  if (source.empty()) {
+    return false;
+  }
+  RouterDbLock updateLock(kRouterDbUpdateLockFile,
+                          RouterDbLock::Mode::kExclusive,
+                          std::chrono::milliseconds(120000));
+  if (!updateLock.Held()) {
+    err = ZARK_PORTMAP_ERR_IO;
+    return false;
+  }
+  StagingFolder staging;
+  if (!CreateStaging(staging, err)) {
+    return false;
+  }
+  const std::string tree = staging.Path() + "/tree";
+  const std::string staged = tree + "/routerdb";
+  RouterDb fetched;
+  if (!FetchAndUnpack(source, staging.Path() + "/archive", tree, err) ||
+      !ReadFetchedDb(source, staged, fetched, err)) {
+    return false;
+  }
+  if (InstalledIsAsNew(fetched, version)) {
+    err = ZARK_PORTMAP_ERR_NONE;
+    return true;
   }
   if (!NormaliseModes(staged) || !SyncFolder(tree)) {
     err = ZARK_PORTMAP_ERR_IO;

@@ -156,6 +156,35 @@ private:
   bool ConnectionOpen();
   void CleanUp();
 
+  // The steps of Init; false when the test ends there (mError set).
+  bool ChooseUpnpRouter();
+  bool MakeProbeAndFindClient();
+  // The TCP ports the user's rules hold on this router, into taken, and
+  // where the router was found before, into memo.
+  void ReadMappingState(std::set<uint16_t> &taken, RouterRecord &memo);
+  bool OpenRouter(RouterRecord &memo);
+  // The TCP ports the router already maps, into taken.
+  void ReadRouterTable(std::set<uint16_t> &taken);
+  // The ports from mEnv.firstPort on that are not taken, as many as the
+  // test may need.
+  [[nodiscard]] std::vector<uint16_t>
+  FreePorts(const std::set<uint16_t> &taken) const;
+  // The connection-check port and the fill candidates after it.
+  bool ChooseTestPorts(const std::vector<uint16_t> &free);
+  // The steps of Fill: adds the candidates until the router's table is
+  // full or mMax is reached, then reads every confirmed one back; false
+  // when the test ends there (mError set).
+  bool AddUntilFull();
+  bool CheckAddedStillHeld();
+  // The steps of Run. MappingCountValid and StartFiles set mResult.error
+  // when they return false; RunStages is true when every stage passed;
+  // Finish cleans up and writes the report; Conclude fills mResult.
+  bool MappingCountValid();
+  bool StartFiles();
+  bool RunStages();
+  void Finish();
+  int Conclude(bool passed);
+
   // Ends the test at stage key (marked failedText) with error and reason.
   bool Fail(const char *stage, const std::string &failedText, int error,
             const std::string &reason);
@@ -269,7 +298,7 @@ ProbeAnswer CompatibilityTest::Probe() {
   return mProbe->Check(IpProtocol::kTcp, mConnectionPort, mListener.Token());
 }
 
-bool CompatibilityTest::Init() {
+bool CompatibilityTest::ChooseUpnpRouter() {
   std::optional<std::string> gateway = mEnv.gateway();
   if (!gateway) {
     return Fail(key::kInit, value::kFailed, ZARK_UPNP_TEST_ERR_INIT,
@@ -295,6 +324,10 @@ bool CompatibilityTest::Init() {
                     ", not UPnP");
   }
   mHaveConf = mEnv.routerConf && mEnv.routerConf(mGateway, mConf);
+  return true;
+}
+
+bool CompatibilityTest::MakeProbeAndFindClient() {
   std::string why;
   mProbe = mEnv.makeProbe ? mEnv.makeProbe(why, [this] { return StopAsked(); })
                           : nullptr;
@@ -309,35 +342,31 @@ bool CompatibilityTest::Init() {
   }
   mClient = *client;
   mRun.client = mClient;
+  return true;
+}
 
-  // Ports the user's rules hold on this router are never touched.
-  std::set<uint16_t> taken;
+void CompatibilityTest::ReadMappingState(std::set<uint16_t> &taken,
+                                         RouterRecord &memo) {
   MappingState state;
-  // Where the router was found before, and finite leases: should the
-  // test's own cleanup and every later one fail, its mappings still run
-  // out within the hour (a router that takes only permanent ones gets
-  // those, after its 725).
-  RouterRecord memo;
-  memo.gateway = mGateway;
-  memo.protocol = RouterProtocol::kUpnp;
-  if (LoadMappingState(mEnv.mappingStatePath, state)) {
-    for (const RouterRecord &record : state.routers) {
-      if (record.gateway != mGateway) {
-        continue;
-      }
-      if (record.protocol == RouterProtocol::kUpnp) {
-        memo.location = record.location;
-      }
-      for (const RecordedMapping &mapping : record.mappings) {
-        if (mapping.protocol == IpProtocol::kTcp) {
-          taken.insert(mapping.externalPort);
-        }
+  if (!LoadMappingState(mEnv.mappingStatePath, state)) {
+    return;
+  }
+  for (const RouterRecord &record : state.routers) {
+    if (record.gateway != mGateway) {
+      continue;
+    }
+    if (record.protocol == RouterProtocol::kUpnp) {
+      memo.location = record.location;
+    }
+    for (const RecordedMapping &mapping : record.mappings) {
+      if (mapping.protocol == IpProtocol::kTcp) {
+        taken.insert(mapping.externalPort);
       }
     }
   }
-  if (MustStop(key::kInit, value::kFailed)) {
-    return false;
-  }
+}
+
+bool CompatibilityTest::OpenRouter(RouterRecord &memo) {
   memo.finiteLeases = true;
   mRouter = mEnv.makeRouter(RouterProtocol::kUpnp, mGateway, &memo);
   if (mRouter == nullptr) {
@@ -351,8 +380,10 @@ bool CompatibilityTest::Init() {
   }
   mRun.location = mRouter->Location();
   Note("using the UPnP service at " + mRun.location + " for " + mClient);
+  return true;
+}
 
-  // And neither are the ports the router already maps for anyone.
+void CompatibilityTest::ReadRouterTable(std::set<uint16_t> &taken) {
   std::vector<RouterMapping> entries;
   RouterResult listed = mRouter->ListMappings(entries);
   if (listed.Ok()) {
@@ -367,7 +398,10 @@ bool CompatibilityTest::Init() {
     Note("the router's table cannot be listed (" + listed.message +
          "); ports found taken are skipped on the way");
   }
+}
 
+std::vector<uint16_t>
+CompatibilityTest::FreePorts(const std::set<uint16_t> &taken) const {
   std::vector<uint16_t> free;
   const std::size_t wanted =
       static_cast<std::size_t>(mMax) + kSparePorts + kListenerTries;
@@ -377,6 +411,10 @@ bool CompatibilityTest::Init() {
       free.push_back(static_cast<uint16_t>(port));
     }
   }
+  return free;
+}
+
+bool CompatibilityTest::ChooseTestPorts(const std::vector<uint16_t> &free) {
   // The connection-check port: the first free one this server can listen
   // on.
   std::size_t first = 0;
@@ -398,6 +436,34 @@ bool CompatibilityTest::Init() {
   }
   mCandidates.assign(free.begin() + static_cast<std::ptrdiff_t>(first) + 1,
                      free.end());
+  return true;
+}
+
+bool CompatibilityTest::Init() {
+  if (!ChooseUpnpRouter() || !MakeProbeAndFindClient()) {
+    return false;
+  }
+  // Ports the user's rules hold on this router are never touched.
+  std::set<uint16_t> taken;
+  // Where the router was found before, and finite leases: should the
+  // test's own cleanup and every later one fail, its mappings still run
+  // out within the hour (a router that takes only permanent ones gets
+  // those, after its 725).
+  RouterRecord memo;
+  memo.gateway = mGateway;
+  memo.protocol = RouterProtocol::kUpnp;
+  ReadMappingState(taken, memo);
+  if (MustStop(key::kInit, value::kFailed)) {
+    return false;
+  }
+  if (!OpenRouter(memo)) {
+    return false;
+  }
+  // And neither are the ports the router already maps for anyone.
+  ReadRouterTable(taken);
+  if (!ChooseTestPorts(FreePorts(taken))) {
+    return false;
+  }
   // Everything the test may map is listed before the first request, so
   // that a killed test can be cleaned up after.
   mRun.ports.push_back(mConnectionPort);
@@ -437,8 +503,7 @@ bool CompatibilityTest::AddFirst() {
   return true;
 }
 
-bool CompatibilityTest::Fill() {
-  mStage = key::kMax;
+bool CompatibilityTest::AddUntilFull() {
   int conflicts = 0;
   std::string limit;
   for (uint16_t port : mCandidates) {
@@ -491,8 +556,10 @@ bool CompatibilityTest::Fill() {
   } else if (mReached < mMax) {
     Note("no more free ports to map after " + std::to_string(mReached));
   }
+  return true;
+}
 
-  // Does the router still hold every mapping it confirmed?
+bool CompatibilityTest::CheckAddedStillHeld() {
   int dropped = 0;
   for (uint16_t port : mAdded) {
     if (MustStop(key::kMax, "-1")) {
@@ -514,6 +581,18 @@ bool CompatibilityTest::Fill() {
                 "the router dropped " + std::to_string(dropped) + " of the " +
                     std::to_string(mAdded.size()) +
                     " mappings it had confirmed");
+  }
+  return true;
+}
+
+bool CompatibilityTest::Fill() {
+  mStage = key::kMax;
+  if (!AddUntilFull()) {
+    return false;
+  }
+  // Does the router still hold every mapping it confirmed?
+  if (!CheckAddedStillHeld()) {
+    return false;
   }
   mProgress.Set(key::kMax, std::to_string(mReached));
   Note("the router holds all " + std::to_string(mReached) + " mapping(s)");
@@ -750,13 +829,84 @@ void CompatibilityTest::WriteReport() {
   }
 }
 
-int CompatibilityTest::Run() {
-  mResult = ZARK_ROUTER_TEST_COMPATIBILITY_RESULT{};
+bool CompatibilityTest::MappingCountValid() {
   if (mMax < 1 || mMax > kMaxUpnpTestMappings) {
     ZARK_PM_LOG_ERROR("UPnP compatibility test: %d mappings asked; 1 to %d "
                       "can be tested",
                       mMax, kMaxUpnpTestMappings);
     mResult.error = ZARK_PORTMAP_ERR_BAD_PARAMETER;
+    return false;
+  }
+  return true;
+}
+
+bool CompatibilityTest::StartFiles() {
+  // A stop asked of an earlier test must not end this one, and what a
+  // killed test left on the router goes first.
+  RemoveFile(mEnv.stopPath);
+  if (!CleanUpEarlierUpnpTest(mEnv)) {
+    ZARK_PM_LOG_ERROR("UPnP compatibility test: mappings of an earlier test "
+                      "are still on the router");
+  }
+  mRun.runId = NewProbeToken();
+  mRun.pid = static_cast<long>(::getpid());
+  if (mRun.runId.empty() || !mProgress.Start() || !SaveRunFile()) {
+    ZARK_PM_LOG_ERROR("UPnP compatibility test: cannot start its files");
+    mResult.error = ZARK_PORTMAP_ERR_GENERIC;
+    return false;
+  }
+  return true;
+}
+
+bool CompatibilityTest::RunStages() {
+  try {
+    return Init() && AddFirst() && Fill() && DeleteAll() &&
+           ConnectionClosed() && Readd() && ConnectionOpen();
+  } catch (const std::exception &e) {
+    // Ends the stage under way; the cleanup after still runs.
+    Fail(mStage, std::strcmp(mStage, key::kMax) == 0 ? "-1" : value::kFailed,
+         ZARK_PORTMAP_ERR_GENERIC, std::string("internal error: ") + e.what());
+  }
+  return false;
+}
+
+void CompatibilityTest::Finish() {
+  try {
+    CleanUp();
+  } catch (const std::exception &e) {
+    ZARK_PM_LOG_ERROR("UPnP compatibility test: cleaning up: %s", e.what());
+    Fail(key::kDelete, value::kFailed, ZARK_UPNP_TEST_ERR_DELETE,
+         std::string("cleaning up: ") + e.what());
+  }
+  if (mRouter == nullptr) {
+    RemoveFile(mEnv.runPath);
+  }
+  mProgress.Set(key::kTerminal, value::kFinished);
+  RemoveFile(mEnv.stopPath);
+  WriteReport();
+}
+
+int CompatibilityTest::Conclude(bool passed) {
+  if (!passed || mError != ZARK_PORTMAP_ERR_NONE) {
+    mResult.error =
+        mError != ZARK_PORTMAP_ERR_NONE ? mError : ZARK_PORTMAP_ERR_GENERIC;
+    Note("ended: failed (error " + std::to_string(mResult.error) + ")");
+    Report(mResult.progress);
+    return -1;
+  }
+  CopyText(mResult.record.brand, mHaveConf ? Field(mConf.brand) : "");
+  CopyText(mResult.record.model, mHaveConf ? Field(mConf.model) : "");
+  CopyText(mResult.record.version, mHaveConf ? Field(mConf.version) : "");
+  CopyText(mResult.record.date, UtcDateText(mEnv.now()));
+  mResult.record.max_mappings = mReached;
+  Note("ended: success, " + std::to_string(mReached) + " mapping(s)");
+  Report(100);
+  return 0;
+}
+
+int CompatibilityTest::Run() {
+  mResult = ZARK_ROUTER_TEST_COMPATIBILITY_RESULT{};
+  if (!MappingCountValid()) {
     return -1;
   }
   RunningTaskMark mark(ZARK_PORTMAP_TASK_UPNP_TEST, mEnv.runningTaskPath);
@@ -776,60 +926,14 @@ int CompatibilityTest::Run() {
     mResult.error = ZARK_PORTMAP_ERR_GENERIC;
     return -1;
   }
-  // A stop asked of an earlier test must not end this one, and what a
-  // killed test left on the router goes first.
-  RemoveFile(mEnv.stopPath);
-  if (!CleanUpEarlierUpnpTest(mEnv)) {
-    ZARK_PM_LOG_ERROR("UPnP compatibility test: mappings of an earlier test "
-                      "are still on the router");
-  }
-  mRun.runId = NewProbeToken();
-  mRun.pid = static_cast<long>(::getpid());
-  if (mRun.runId.empty() || !mProgress.Start() || !SaveRunFile()) {
-    ZARK_PM_LOG_ERROR("UPnP compatibility test: cannot start its files");
-    mResult.error = ZARK_PORTMAP_ERR_GENERIC;
+  if (!StartFiles()) {
     return -1;
   }
   Report(0);
   Note("started: up to " + std::to_string(mMax) + " mapping(s)");
-
-  bool passed = false;
-  try {
-    passed = Init() && AddFirst() && Fill() && DeleteAll() &&
-             ConnectionClosed() && Readd() && ConnectionOpen();
-  } catch (const std::exception &e) {
-    // Ends the stage under way; the cleanup below still runs.
-    Fail(mStage, std::strcmp(mStage, key::kMax) == 0 ? "-1" : value::kFailed,
-         ZARK_PORTMAP_ERR_GENERIC, std::string("internal error: ") + e.what());
-  }
-  try {
-    CleanUp();
-  } catch (const std::exception &e) {
-    ZARK_PM_LOG_ERROR("UPnP compatibility test: cleaning up: %s", e.what());
-    Fail(key::kDelete, value::kFailed, ZARK_UPNP_TEST_ERR_DELETE,
-         std::string("cleaning up: ") + e.what());
-  }
-  if (mRouter == nullptr) {
-    RemoveFile(mEnv.runPath);
-  }
-  mProgress.Set(key::kTerminal, value::kFinished);
-  RemoveFile(mEnv.stopPath);
-  WriteReport();
-  if (!passed || mError != ZARK_PORTMAP_ERR_NONE) {
-    mResult.error =
-        mError != ZARK_PORTMAP_ERR_NONE ? mError : ZARK_PORTMAP_ERR_GENERIC;
-    Note("ended: failed (error " + std::to_string(mResult.error) + ")");
-    Report(mResult.progress);
-    return -1;
-  }
-  CopyText(mResult.record.brand, mHaveConf ? Field(mConf.brand) : "");
-  CopyText(mResult.record.model, mHaveConf ? Field(mConf.model) : "");
-  CopyText(mResult.record.version, mHaveConf ? Field(mConf.version) : "");
-  CopyText(mResult.record.date, UtcDateText(mEnv.now()));
-  mResult.record.max_mappings = mReached;
-  Note("ended: success, " + std::to_string(mReached) + " mapping(s)");
-  Report(100);
-  return 0;
+  const bool passed = RunStages();
+  Finish();
+  return Conclude(passed);
 }
 
 // Marks the stage a killed test left "processing" as failed, so that a

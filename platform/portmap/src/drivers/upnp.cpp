@@ -246,6 +246,88 @@ RouterResult UpnpRouter::Open() {
   return last;
 }
 
+namespace {
+
+// A WANIPConnection or WANPPPConnection service of a root description.
+struct ConnectionService {
+  std::string type;
+  std::string controlUrl;
+};
+
+// The connection services of the description at url, with their control
+// URLs. miniupnpc keeps the first WANIPConnection or WANPPPConnection
+// service (any version) in data.first and a second one in data.second.
+std::vector<ConnectionService> ConnectionServices(const std::string &url,
+                                                  const IGDdatas &data,
+                                                  OwnedUrls &urls) {
+  std::vector<ConnectionService> services;
+  const std::string firstType = CleanServiceType(data.first.servicetype);
+  const std::string secondType = CleanServiceType(data.second.servicetype);
+  if (!firstType.empty() && urls.Get()->controlURL != nullptr) {
+    services.push_back({firstType, urls.Get()->controlURL});
+  }
+  if (!secondType.empty()) {
+    // Build the second service's control URL the way miniupnpc builds the
+    // first one's: with the two swapped.
+    IGDdatas swapped = data;
+    std::swap(swapped.first, swapped.second);
+    OwnedUrls secondUrls;
+    GetUPNPUrls(secondUrls.Get(), &swapped, url.c_str(), 0);
+    if (secondUrls.Get()->controlURL != nullptr) {
+      services.push_back({secondType, secondUrls.Get()->controlURL});
+    }
+  }
+  return services;
+}
+
+// The services whose control URL is on our own network. A description may
+// point its control URL anywhere (an absolute URL or URLBase); only a host
+// on our own network gets requests. Each one refused is logged, and the
+// last one's text left in refusal.
+std::vector<ConnectionService> ServicesOnLocalNetwork(
+    std::vector<ConnectionService> services, const std::string &url,
+    const std::vector<Ipv4Network> &networks,
+    const std::optional<uint32_t> &gateway, std::string &refusal) {
+  std::vector<ConnectionService> usable;
+  for (ConnectionService &service : services) {
+    if (IsUrlOnLocalNetwork(service.controlUrl, networks, gateway)) {
+      usable.push_back(std::move(service));
+    } else {
+      refusal = "refusing control URL " + service.controlUrl +
+                " of the UPnP device at " + url + ": host " +
+                HostOf(service.controlUrl) + " is not on the local network";
+      ZARK_PM_LOG_ERROR("%s", refusal.c_str());
+    }
+  }
+  return usable;
+}
+
+// With two connection services, the one that is connected; asking costs a
+// request, so it is only done when there is a choice. The first one when
+// none says it is connected.
+std::size_t ConnectedService(const std::vector<ConnectionService> &usable) {
+  if (usable.size() <= 1) {
+    return 0;
+  }
+  for (std::size_t i = 0; i < usable.size(); ++i) {
+    char status[64] = {};
+    char lastError[64] = {};
+    unsigned int uptime = 0;
+    int statusRc =
+        UPNP_GetStatusInfo(usable[i].controlUrl.c_str(), usable[i].type.c_str(),
+                           status, &uptime, lastError);
+    RouterResult asked = ZARK_PM_CLASSIFY("UPNP_GetStatusInfo", statusRc,
+                                          usable[i].type + " status \"" +
+                                              std::string(status) + "\"");
+    if (asked.Ok() && std::strcmp(status, "Connected") == 0) {
+      return i;
+    }
+  }
+  return 0;
+}
+
+} // namespace
+
 RouterResult UpnpRouter::TryRootDescription(const std::string &url) {
   RouterResult result;
   result.outcome = RouterOutcome::kNoRouter;
@@ -269,78 +351,23 @@ RouterResult UpnpRouter::TryRootDescription(const std::string &url) {
     return result;
   }
 
-  // miniupnpc keeps the first WANIPConnection or WANPPPConnection service
-  // (any version) in data.first and a second one in data.second.
-  struct Service {
-    std::string type;
-    std::string controlUrl;
-  };
-  std::vector<Service> services;
-  const std::string firstType = CleanServiceType(data.first.servicetype);
-  const std::string secondType = CleanServiceType(data.second.servicetype);
-  if (!firstType.empty() && urls.Get()->controlURL != nullptr) {
-    services.push_back({firstType, urls.Get()->controlURL});
-  }
-  if (!secondType.empty()) {
-    // Build the second service's control URL the way miniupnpc builds the
-    // first one's: with the two swapped.
-    IGDdatas swapped = data;
-    std::swap(swapped.first, swapped.second);
-    OwnedUrls secondUrls;
-    GetUPNPUrls(secondUrls.Get(), &swapped, url.c_str(), 0);
-    if (secondUrls.Get()->controlURL != nullptr) {
-      services.push_back({secondType, secondUrls.Get()->controlURL});
-    }
-  }
+  std::vector<ConnectionService> services = ConnectionServices(url, data, urls);
   if (services.empty()) {
     result.message = "the UPnP device at " + url +
                      " has no WANIPConnection or WANPPPConnection service";
     ZARK_PM_LOG_ERROR("%s", result.message.c_str());
     return result;
   }
-
-  // A description may point its control URL anywhere (an absolute URL or
-  // URLBase); only a host on our own network gets requests.
-  std::vector<Service> usable;
-  for (Service &service : services) {
-    if (IsUrlOnLocalNetwork(service.controlUrl, mNetworks, mGateway)) {
-      usable.push_back(std::move(service));
-    } else {
-      result.message = "refusing control URL " + service.controlUrl +
-                       " of the UPnP device at " + url + ": host " +
-                       HostOf(service.controlUrl) +
-                       " is not on the local network";
-      ZARK_PM_LOG_ERROR("%s", result.message.c_str());
-    }
-  }
+  std::vector<ConnectionService> usable = ServicesOnLocalNetwork(
+      std::move(services), url, mNetworks, mGateway, result.message);
   if (usable.empty()) {
     return result;
   }
-
-  // With two connection services, use the one that is connected; asking
-  // costs a request, so it is only done when there is a choice.
-  std::size_t chosen = 0;
-  if (usable.size() > 1) {
-    for (std::size_t i = 0; i < usable.size(); ++i) {
-      char status[64] = {};
-      char lastError[64] = {};
-      unsigned int uptime = 0;
-      int statusRc = UPNP_GetStatusInfo(usable[i].controlUrl.c_str(),
-                                        usable[i].type.c_str(), status, &uptime,
-                                        lastError);
-      RouterResult asked = ZARK_PM_CLASSIFY("UPNP_GetStatusInfo", statusRc,
-                                            usable[i].type + " status \"" +
-                                                std::string(status) + "\"");
-      if (asked.Ok() && std::strcmp(status, "Connected") == 0) {
-        chosen = i;
-        break;
-      }
-    }
-  }
+  const ConnectionService &chosen = usable[ConnectedService(usable)];
 
   mRootDescUrl = url;
-  mServiceType = usable[chosen].type;
-  mControlUrl = usable[chosen].controlUrl;
+  mServiceType = chosen.type;
+  mControlUrl = chosen.controlUrl;
   mOpen = true;
   result.outcome = RouterOutcome::kOk;
   result.message = "using " + mServiceType + " at " + mControlUrl +

@@ -110,19 +110,26 @@ std::optional<SsdpReply> ParseSsdpReply(std::string_view datagram) {
   return reply;
 }
 
-std::vector<std::string> SearchIgds(const SsdpSearchOptions &options) {
-  std::vector<std::string> found;
-  const std::optional<uint32_t> gateway = ParseIpv4(options.gateway);
+namespace {
+
+// A UDP socket for the search, or an invalid one (logged).
+UniqueFd OpenSearchSocket() {
   UniqueFd fd(::socket(AF_INET, SOCK_DGRAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0));
   if (!fd.Valid()) {
     ZARK_PM_LOG_CALL("socket", -1, errno, "(SSDP search)");
-    return found;
+    return fd;
   }
   // SSDP's own advice: multicast searches go no further than a couple of
   // routers.
   const int ttl = 2;
   (void)::setsockopt(fd.Get(), IPPROTO_IP, IP_MULTICAST_TTL, &ttl, sizeof(ttl));
+  return fd;
+}
 
+// Where the searches go: the gateway itself, when known, then the SSDP
+// group when options.multicast.
+std::vector<sockaddr_in> SearchDestinations(const SsdpSearchOptions &options,
+                                            std::optional<uint32_t> gateway) {
   std::vector<sockaddr_in> targets;
   if (gateway) {
     sockaddr_in direct{};
@@ -138,51 +145,67 @@ std::vector<std::string> SearchIgds(const SsdpSearchOptions &options) {
     ::inet_pton(AF_INET, kSsdpMulticastGroup, &group.sin_addr);
     targets.push_back(group);
   }
+  return targets;
+}
+
+// Sends every search target to every destination; true when one went out.
+bool SendSearches(int fd, const std::vector<sockaddr_in> &destinations,
+                  const std::vector<std::string> &searchTargets) {
   bool sentAny = false;
-  for (const sockaddr_in &target : targets) {
-    for (const std::string &searchTarget : options.searchTargets) {
-      sentAny =
-          SendTo(fd.Get(), BuildMSearch(searchTarget, 1), target) || sentAny;
+  for (const sockaddr_in &target : destinations) {
+    for (const std::string &searchTarget : searchTargets) {
+      sentAny = SendTo(fd, BuildMSearch(searchTarget, 1), target) || sentAny;
     }
   }
-  if (!sentAny) {
-    return found;
-  }
+  return sentAny;
+}
 
-  auto isGateways = [&](const std::string &url) {
-    std::optional<std::string> host = UrlHost(url);
-    return gateway && host && ParseIpv4(*host) == gateway;
-  };
-  const Clock::time_point deadline = Clock::now() + options.wait;
+bool IsGatewayUrl(const std::string &url, std::optional<uint32_t> gateway) {
+  std::optional<std::string> host = UrlHost(url);
+  return gateway && host && ParseIpv4(*host) == gateway;
+}
+
+// The next datagram that came before deadline, or nothing when the
+// deadline passed or the socket failed (logged).
+std::optional<std::string> ReceiveDatagram(int fd, Clock::time_point deadline) {
   for (;;) {
     const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
         deadline - Clock::now());
     if (left.count() <= 0) {
-      break;
+      return std::nullopt;
     }
-    pollfd watched{fd.Get(), POLLIN, 0};
+    pollfd watched{fd, POLLIN, 0};
     const int ready = ::poll(&watched, 1, static_cast<int>(left.count()) + 1);
     if (ready < 0) {
       if (errno == EINTR) {
         continue;
       }
       ZARK_PM_LOG_CALL("poll", ready, errno, "(SSDP search)");
-      break;
+      return std::nullopt;
     }
     if (ready == 0) {
       continue;
     }
     char buffer[kMaxDatagram];
-    const ssize_t got = ::recv(fd.Get(), buffer, sizeof(buffer), 0);
+    const ssize_t got = ::recv(fd, buffer, sizeof(buffer), 0);
     if (got < 0) {
       if (errno == EAGAIN || errno == EINTR) {
         continue;
       }
       ZARK_PM_LOG_CALL("recv", got, errno, "(SSDP search)");
-      break;
+      return std::nullopt;
     }
-    std::optional<SsdpReply> reply =
-        ParseSsdpReply(std::string_view(buffer, static_cast<std::size_t>(got)));
+    return std::string(buffer, static_cast<std::size_t>(got));
+  }
+}
+
+// The locations of the devices that answer before deadline, each once;
+// stops early at the gateway's own answer.
+std::vector<std::string> CollectLocations(int fd, Clock::time_point deadline,
+                                          std::optional<uint32_t> gateway) {
+  std::vector<std::string> found;
+  while (std::optional<std::string> datagram = ReceiveDatagram(fd, deadline)) {
+    std::optional<SsdpReply> reply = ParseSsdpReply(*datagram);
     if (!reply) {
       continue;
     }
@@ -192,11 +215,28 @@ std::vector<std::string> SearchIgds(const SsdpSearchOptions &options) {
                        reply->searchTarget.c_str(), reply->server.c_str());
       found.push_back(reply->location);
     }
-    if (isGateways(reply->location)) {
+    if (IsGatewayUrl(reply->location, gateway)) {
       break;
     }
   }
-  std::stable_partition(found.begin(), found.end(), isGateways);
+  return found;
+}
+
+} // namespace
+
+std::vector<std::string> SearchIgds(const SsdpSearchOptions &options) {
+  const std::optional<uint32_t> gateway = ParseIpv4(options.gateway);
+  UniqueFd fd = OpenSearchSocket();
+  if (!fd.Valid() ||
+      !SendSearches(fd.Get(), SearchDestinations(options, gateway),
+                    options.searchTargets)) {
+    return {};
+  }
+  std::vector<std::string> found =
+      CollectLocations(fd.Get(), Clock::now() + options.wait, gateway);
+  std::stable_partition(
+      found.begin(), found.end(),
+      [&](const std::string &url) { return IsGatewayUrl(url, gateway); });
   return found;
 }
 

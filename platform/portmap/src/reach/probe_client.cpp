@@ -57,6 +57,197 @@ ProbeAnswer Unavailable(std::string why) {
   return answer;
 }
 
+ProbeAnswer CancelledAnswer() {
+  ProbeAnswer answer;
+  answer.status = ProbeStatus::kCancelled;
+  answer.reason = "cancelled";
+  return answer;
+}
+
+ProbeAnswer BadAnswer(std::string why) {
+  ProbeAnswer bad;
+  bad.status = ProbeStatus::kBadAnswer;
+  bad.reason = std::move(why);
+  return bad;
+}
+
+// One connection to the probe service at where, for one request line and
+// its answer line. Each step returns nothing when it succeeded and the
+// answer to give otherwise.
+class ProbeConnection {
+public:
+  ProbeConnection(UniqueFd fd, const std::string &where,
+                  const std::function<bool()> &cancelled)
+      : mFd(std::move(fd)), mWhere(where), mCancelled(cancelled) {}
+
+  [[nodiscard]] std::optional<ProbeAnswer>
+  Connect(const sockaddr_storage &address, socklen_t addressLength,
+          std::chrono::milliseconds timeout) {
+    const Clock::time_point deadline = Clock::now() + timeout;
+    if (::connect(mFd.Get(), reinterpret_cast<const sockaddr *>(&address),
+                  addressLength) == 0) {
+      return std::nullopt;
+    }
+    if (errno != EINPROGRESS) {
+      int saved = errno;
+      ZARK_PM_LOG_CALL("connect", -1, saved, mWhere.c_str());
+      return Unavailable("the probe service at " + mWhere +
+                         " refuses connections (" + std::strerror(saved) + ")");
+    }
+    Waited ready = Wait(POLLOUT, deadline);
+    if (ready == Waited::kCancelled) {
+      return CancelledAnswer();
+    }
+    if (ready == Waited::kNotReady) {
+      ZARK_PM_LOG_ERROR("the probe service at %s did not accept within %lld "
+                        "ms",
+                        mWhere.c_str(),
+                        static_cast<long long>(timeout.count()));
+      return Unavailable("the probe service at " + mWhere + " does not answer");
+    }
+    int error = 0;
+    socklen_t length = sizeof(error);
+    if (::getsockopt(mFd.Get(), SOL_SOCKET, SO_ERROR, &error, &length) != 0 ||
+        error != 0) {
+      ZARK_PM_LOG_CALL("connect", -1, error, mWhere.c_str());
+      return Unavailable("the probe service at " + mWhere +
+                         " refuses connections (" + std::strerror(error) + ")");
+    }
+    return std::nullopt;
+  }
+
+  [[nodiscard]] std::optional<ProbeAnswer>
+  SendLine(std::string_view line, Clock::time_point deadline) {
+    std::string_view pending = line;
+    while (!pending.empty()) {
+      ssize_t sent =
+          ::send(mFd.Get(), pending.data(), pending.size(), MSG_NOSIGNAL);
+      if (sent > 0) {
+        pending.remove_prefix(static_cast<std::size_t>(sent));
+        continue;
+      }
+      if (sent < 0 && errno != EAGAIN && errno != EINTR) {
+        int saved = errno;
+        ZARK_PM_LOG_CALL("send", -1, saved, mWhere.c_str());
+        return Closed();
+      }
+      Waited ready = Wait(POLLOUT, deadline);
+      if (ready == Waited::kCancelled) {
+        return CancelledAnswer();
+      }
+      if (ready == Waited::kNotReady) {
+        return Unavailable("the probe service at " + mWhere +
+                           " does not take the request");
+      }
+    }
+    return std::nullopt;
+  }
+
+  // Reads the answer to request up to its newline, into answerLine without
+  // the newline; timeout is the one deadline was set with, for the log.
+  [[nodiscard]] std::optional<ProbeAnswer>
+  ReceiveLine(const std::string &request, Clock::time_point deadline,
+              std::chrono::milliseconds timeout, std::string &answerLine) {
+    for (;;) {
+      std::size_t newline = answerLine.find('\n');
+      if (newline != std::string::npos) {
+        answerLine.resize(newline);
+        return std::nullopt;
+      }
+      if (answerLine.size() > kMaxAnswerLine) {
+        ZARK_PM_LOG_ERROR("the probe service at %s sent a line over %zu bytes",
+                          mWhere.c_str(), kMaxAnswerLine);
+        return BadAnswer("an answer line that is too long");
+      }
+      Waited ready = Wait(POLLIN, deadline);
+      if (ready == Waited::kCancelled) {
+        return CancelledAnswer();
+      }
+      if (ready == Waited::kNotReady) {
+        ZARK_PM_LOG_ERROR("the probe service at %s did not answer \"%.*s\" "
+                          "within %lld ms",
+                          mWhere.c_str(), static_cast<int>(request.size() - 1),
+                          request.c_str(),
+                          static_cast<long long>(timeout.count()));
+        return Unavailable("the probe service at " + mWhere +
+                           " did not answer in time");
+      }
+      char buffer[256];
+      ssize_t n = ::recv(mFd.Get(), buffer, sizeof(buffer), 0);
+      if (n < 0) {
+        if (errno == EAGAIN || errno == EINTR) {
+          continue;
+        }
+        int saved = errno;
+        ZARK_PM_LOG_CALL("recv", -1, saved, mWhere.c_str());
+        return Closed();
+      }
+      if (n == 0) {
+        ZARK_PM_LOG_ERROR("the probe service at %s closed the connection "
+                          "without an answer",
+                          mWhere.c_str());
+        return Closed();
+      }
+      answerLine.append(buffer, static_cast<std::size_t>(n));
+    }
+  }
+
+private:
+  enum class Waited { kReady, kNotReady, kCancelled };
+
+  // Waits in slices so that a cancellation is seen within 100 ms. kNotReady
+  // when the deadline passed or poll failed.
+  Waited Wait(short events, Clock::time_point deadline) {
+    for (;;) {
+      if (mCancelled && mCancelled()) {
+        return Waited::kCancelled;
+      }
+      auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+          deadline - Clock::now());
+      if (left.count() <= 0) {
+        return Waited::kNotReady;
+      }
+      left = std::min<std::chrono::milliseconds>(left, kCancelSlice);
+      pollfd watched{mFd.Get(), events, 0};
+      int ready = ::poll(&watched, 1, static_cast<int>(left.count()));
+      if (ready > 0) {
+        return Waited::kReady;
+      }
+      if (ready < 0 && errno != EINTR) {
+        return Waited::kNotReady;
+      }
+    }
+  }
+
+  ProbeAnswer Closed() const {
+    return Unavailable("the probe service at " + mWhere +
+                       " closed the connection");
+  }
+
+  UniqueFd mFd;
+  const std::string &mWhere;
+  const std::function<bool()> &mCancelled;
+};
+
+// The answer that line, the service's answer to request, carries; a bad
+// answer when it is not one of the protocol.
+ProbeAnswer AnswerOfLine(const std::string &where, const std::string &request,
+                         const std::string &answerLine) {
+  std::optional<ProbeAnswer> answer = ParseProbeAnswer(answerLine);
+  if (!answer) {
+    ZARK_PM_LOG_ERROR("the probe service at %s answered \"%.200s\", which is "
+                      "not an answer of its protocol",
+                      where.c_str(), answerLine.c_str());
+    return BadAnswer("an answer that is not understood");
+  }
+  if (answer->status == ProbeStatus::kRefused) {
+    ZARK_PM_LOG_ERROR("the probe service at %s refused \"%.*s\": %s",
+                      where.c_str(), static_cast<int>(request.size() - 1),
+                      request.c_str(), answer->reason.c_str());
+  }
+  return *answer;
+}
+
 } // namespace
 
 const char *ProbeStatusName(ProbeStatus status) {
@@ -295,159 +486,21 @@ ProbeAnswer ProbeClient::ExchangeOnce(const std::string &line) {
     ZARK_PM_LOG_CALL("socket", -1, saved, where.c_str());
     return Unavailable("no socket for the probe service");
   }
-  // Waits in slices so that a cancellation is seen within 100 ms. 1 ready,
-  // 0 deadline passed, -1 failed or cancelled (cancelled set).
-  bool cancelled = false;
-  auto wait = [&](short events, Clock::time_point deadline) -> int {
-    for (;;) {
-      if (Cancelled()) {
-        cancelled = true;
-        return -1;
-      }
-      auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-          deadline - Clock::now());
-      if (left.count() <= 0) {
-        return 0;
-      }
-      left = std::min<std::chrono::milliseconds>(left, kCancelSlice);
-      pollfd watched{fd.Get(), events, 0};
-      int ready = ::poll(&watched, 1, static_cast<int>(left.count()));
-      if (ready > 0) {
-        return 1;
-      }
-      if (ready < 0 && errno != EINTR) {
-        return -1;
-      }
-    }
-  };
-  auto cancelledAnswer = [] {
-    ProbeAnswer answer;
-    answer.status = ProbeStatus::kCancelled;
-    answer.reason = "cancelled";
-    return answer;
-  };
-
-  const Clock::time_point connectDeadline =
-      Clock::now() + mOptions.connectTimeout;
-  if (::connect(fd.Get(), reinterpret_cast<const sockaddr *>(&mAddress),
-                mAddressLength) != 0) {
-    if (errno != EINPROGRESS) {
-      int saved = errno;
-      ZARK_PM_LOG_CALL("connect", -1, saved, where.c_str());
-      return Unavailable("the probe service at " + where +
-                         " refuses connections (" + std::strerror(saved) + ")");
-    }
-    int ready = wait(POLLOUT, connectDeadline);
-    if (cancelled) {
-      return cancelledAnswer();
-    }
-    if (ready <= 0) {
-      ZARK_PM_LOG_ERROR(
-          "the probe service at %s did not accept within %lld "
-          "ms",
-          where.c_str(),
-          static_cast<long long>(mOptions.connectTimeout.count()));
-      return Unavailable("the probe service at " + where + " does not answer");
-    }
-    int error = 0;
-    socklen_t length = sizeof(error);
-    if (::getsockopt(fd.Get(), SOL_SOCKET, SO_ERROR, &error, &length) != 0 ||
-        error != 0) {
-      ZARK_PM_LOG_CALL("connect", -1, error, where.c_str());
-      return Unavailable("the probe service at " + where +
-                         " refuses connections (" + std::strerror(error) + ")");
-    }
+  ProbeConnection connection(std::move(fd), where, mOptions.cancelled);
+  if (std::optional<ProbeAnswer> failed = connection.Connect(
+          mAddress, mAddressLength, mOptions.connectTimeout)) {
+    return *failed;
   }
-
   const Clock::time_point deadline = Clock::now() + mOptions.answerTimeout;
-  std::string_view pending = line;
-  while (!pending.empty()) {
-    ssize_t sent =
-        ::send(fd.Get(), pending.data(), pending.size(), MSG_NOSIGNAL);
-    if (sent > 0) {
-      pending.remove_prefix(static_cast<std::size_t>(sent));
-      continue;
-    }
-    if (sent < 0 && errno != EAGAIN && errno != EINTR) {
-      int saved = errno;
-      ZARK_PM_LOG_CALL("send", -1, saved, where.c_str());
-      return Unavailable("the probe service at " + where +
-                         " closed the connection");
-    }
-    int ready = wait(POLLOUT, deadline);
-    if (cancelled) {
-      return cancelledAnswer();
-    }
-    if (ready <= 0) {
-      return Unavailable("the probe service at " + where +
-                         " does not take the request");
-    }
+  if (std::optional<ProbeAnswer> failed = connection.SendLine(line, deadline)) {
+    return *failed;
   }
-
   std::string answerLine;
-  for (;;) {
-    std::size_t newline = answerLine.find('\n');
-    if (newline != std::string::npos) {
-      answerLine.resize(newline);
-      break;
-    }
-    if (answerLine.size() > kMaxAnswerLine) {
-      ZARK_PM_LOG_ERROR("the probe service at %s sent a line over %zu bytes",
-                        where.c_str(), kMaxAnswerLine);
-      ProbeAnswer bad;
-      bad.status = ProbeStatus::kBadAnswer;
-      bad.reason = "an answer line that is too long";
-      return bad;
-    }
-    int ready = wait(POLLIN, deadline);
-    if (cancelled) {
-      return cancelledAnswer();
-    }
-    if (ready <= 0) {
-      ZARK_PM_LOG_ERROR("the probe service at %s did not answer \"%.*s\" "
-                        "within %lld ms",
-                        where.c_str(), static_cast<int>(line.size() - 1),
-                        line.c_str(),
-                        static_cast<long long>(mOptions.answerTimeout.count()));
-      return Unavailable("the probe service at " + where +
-                         " did not answer in time");
-    }
-    char buffer[256];
-    ssize_t n = ::recv(fd.Get(), buffer, sizeof(buffer), 0);
-    if (n < 0) {
-      if (errno == EAGAIN || errno == EINTR) {
-        continue;
-      }
-      int saved = errno;
-      ZARK_PM_LOG_CALL("recv", -1, saved, where.c_str());
-      return Unavailable("the probe service at " + where +
-                         " closed the connection");
-    }
-    if (n == 0) {
-      ZARK_PM_LOG_ERROR("the probe service at %s closed the connection "
-                        "without an answer",
-                        where.c_str());
-      return Unavailable("the probe service at " + where +
-                         " closed the connection");
-    }
-    answerLine.append(buffer, static_cast<std::size_t>(n));
+  if (std::optional<ProbeAnswer> failed = connection.ReceiveLine(
+          line, deadline, mOptions.answerTimeout, answerLine)) {
+    return *failed;
   }
-  std::optional<ProbeAnswer> answer = ParseProbeAnswer(answerLine);
-  if (!answer) {
-    ZARK_PM_LOG_ERROR("the probe service at %s answered \"%.200s\", which is "
-                      "not an answer of its protocol",
-                      where.c_str(), answerLine.c_str());
-    ProbeAnswer bad;
-    bad.status = ProbeStatus::kBadAnswer;
-    bad.reason = "an answer that is not understood";
-    return bad;
-  }
-  if (answer->status == ProbeStatus::kRefused) {
-    ZARK_PM_LOG_ERROR("the probe service at %s refused \"%.*s\": %s",
-                      where.c_str(), static_cast<int>(line.size() - 1),
-                      line.c_str(), answer->reason.c_str());
-  }
-  return *answer;
+  return AnswerOfLine(where, line, answerLine);
 }
 
 std::unique_ptr<ProbeClient> ConfiguredProbeClient(std::string &why,

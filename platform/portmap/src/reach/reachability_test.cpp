@@ -245,187 +245,148 @@ PortTestEnvironment DefaultPortTestEnvironment() {
   return environment;
 }
 
-int RunPortTest(std::span<const ZARK_ROUTER_RULE> rules,
-                const PortTestEnvironment &environment,
-                PortTestSummary *summary) {
-  PortTestSummary local;
-  PortTestSummary &counts = summary != nullptr ? *summary : local;
-  counts = PortTestSummary{};
+namespace {
 
+// The plans of the enabled rules, in the order of the rule list.
+std::vector<RuleChecks>
+PlanEnabledRules(std::span<const ZARK_ROUTER_RULE> rules) {
   std::vector<RuleChecks> plans;
   for (const ZARK_ROUTER_RULE &rule : rules) {
     if (rule.enable != 0) {
       plans.push_back(PlanRuleChecks(rule));
     }
   }
-  counts.rules = static_cast<int>(plans.size());
+  return plans;
+}
+
+std::vector<std::string> RuleIdsOf(const std::vector<RuleChecks> &plans) {
   std::vector<std::string> ids;
   ids.reserve(plans.size());
   for (const RuleChecks &plan : plans) {
     ids.push_back(plan.ruleId);
   }
-  StatusFile status(environment.statusPath, ids);
-  // Every rule "being tested" first, so that a reader sees the whole list.
-  if (!status.Write()) {
-    ZARK_PM_LOG_ERROR("port test: cannot write %s",
-                      environment.statusPath.c_str());
-    counts.error = ZARK_PORTMAP_ERR_IO;
-    return -1;
-  }
-  if (plans.empty()) {
-    return 0;
+  return ids;
+}
+
+// One port test: the plans of its rules, their results as checks finish,
+// the status file and the counts of the summary.
+class PortTestRun {
+public:
+  PortTestRun(std::vector<RuleChecks> plans,
+              const PortTestEnvironment &environment, PortTestSummary &counts)
+      : mEnvironment(environment), mCounts(counts), mPlans(std::move(plans)),
+        mStatus(environment.statusPath, RuleIdsOf(mPlans)),
+        mResults(mPlans.size()), mPending(mPlans.size()) {}
+
+  int Run() {
+    // Every rule "being tested" first, so that a reader sees the whole list.
+    if (!mStatus.Write()) {
+      ZARK_PM_LOG_ERROR("port test: cannot write %s",
+                        mEnvironment.statusPath.c_str());
+      mCounts.error = ZARK_PORTMAP_ERR_IO;
+      return -1;
+    }
+    if (mPlans.empty()) {
+      return 0;
+    }
+    AdmitRules();
+    std::unique_ptr<OutsideProbe> probe = MakeProbe();
+    if (probe == nullptr) {
+      return -1;
+    }
+    CheckGroupsInWorkers(GroupChecksByLocalPort(), *probe);
+    const bool unfinished = MarkUnfinishedRules();
+    LogSummary();
+    return Conclude(unfinished);
   }
 
-  // Results per rule, filled as checks finish.
-  std::vector<std::vector<CheckResult>> results(plans.size());
-  std::vector<std::size_t> pending(plans.size());
-  int toCheck = 0;
-  for (std::size_t i = 0; i < plans.size(); ++i) {
-    if (!plans[i].refusal.empty()) {
-      ZARK_PM_LOG_ERROR("port test: rule \"%s\" cannot be tested: %s",
-                        plans[i].ruleId.c_str(), plans[i].refusal.c_str());
-      status.Set(i, plans[i].refusal);
-      continue;
+private:
+  // Reports the rules that cannot be tested or that go beyond the limit of
+  // checks, and readies the results of the others.
+  void AdmitRules() {
+    for (std::size_t i = 0; i < mPlans.size(); ++i) {
+      if (!mPlans[i].refusal.empty()) {
+        ZARK_PM_LOG_ERROR("port test: rule \"%s\" cannot be tested: %s",
+                          mPlans[i].ruleId.c_str(), mPlans[i].refusal.c_str());
+        mStatus.Set(i, mPlans[i].refusal);
+        continue;
+      }
+      const int checks = static_cast<int>(mPlans[i].checks.size());
+      if (mToCheck + checks > mEnvironment.maxChecks) {
+        mStatus.Set(i, "not tested: more than " +
+                           std::to_string(mEnvironment.maxChecks) +
+                           " ports in one test");
+        mPlans[i].checks.clear();
+        continue;
+      }
+      mToCheck += checks;
+      mResults[i].resize(mPlans[i].checks.size());
+      mPending[i] = mPlans[i].checks.size();
     }
-    const int checks = static_cast<int>(plans[i].checks.size());
-    if (toCheck + checks > environment.maxChecks) {
-      status.Set(i, "not tested: more than " +
-                        std::to_string(environment.maxChecks) +
-                        " ports in one test");
-      plans[i].checks.clear();
-      continue;
-    }
-    toCheck += checks;
-    results[i].resize(plans[i].checks.size());
-    pending[i] = plans[i].checks.size();
   }
 
-  std::string why;
-  std::unique_ptr<OutsideProbe> probe =
-      environment.makeProbe ? environment.makeProbe(why) : nullptr;
-  if (probe == nullptr) {
+  // The outside probe; null, with every pending rule told why, when there
+  // is none.
+  std::unique_ptr<OutsideProbe> MakeProbe() {
+    std::string why;
+    std::unique_ptr<OutsideProbe> probe =
+        mEnvironment.makeProbe ? mEnvironment.makeProbe(why) : nullptr;
+    if (probe != nullptr) {
+      return probe;
+    }
     if (why.empty()) {
       why = kNoProbeServiceText;
     }
     ZARK_PM_LOG_ERROR("port test: %s; no rule can be tested", why.c_str());
-    for (std::size_t i = 0; i < plans.size(); ++i) {
-      if (pending[i] > 0) {
-        status.Set(i, why);
+    for (std::size_t i = 0; i < mPlans.size(); ++i) {
+      if (mPending[i] > 0) {
+        mStatus.Set(i, why);
       }
     }
-    counts.error = ZARK_PORTMAP_ERR_PROBE_SERVICE;
-    return -1;
+    mCounts.error = ZARK_PORTMAP_ERR_PROBE_SERVICE;
+    return nullptr;
   }
 
-  std::map<std::pair<IpProtocol, uint16_t>, LocalPortGroup> byLocalPort;
-  for (std::size_t i = 0; i < plans.size(); ++i) {
-    if (pending[i] == 0) {
-      continue;
+  // The pending checks, grouped by local port and protocol.
+  std::vector<LocalPortGroup> GroupChecksByLocalPort() const {
+    std::map<std::pair<IpProtocol, uint16_t>, LocalPortGroup> byLocalPort;
+    for (std::size_t i = 0; i < mPlans.size(); ++i) {
+      if (mPending[i] == 0) {
+        continue;
+      }
+      for (std::size_t c = 0; c < mPlans[i].checks.size(); ++c) {
+        const PortCheck &check = mPlans[i].checks[c];
+        LocalPortGroup &group = byLocalPort[{check.protocol, check.localPort}];
+        group.protocol = check.protocol;
+        group.localPort = check.localPort;
+        group.checks.push_back({i, c});
+      }
     }
-    for (std::size_t c = 0; c < plans[i].checks.size(); ++c) {
-      const PortCheck &check = plans[i].checks[c];
-      LocalPortGroup &group = byLocalPort[{check.protocol, check.localPort}];
-      group.protocol = check.protocol;
-      group.localPort = check.localPort;
-      group.checks.push_back({i, c});
+    std::vector<LocalPortGroup> groups;
+    groups.reserve(byLocalPort.size());
+    for (auto &[key, group] : byLocalPort) {
+      groups.push_back(std::move(group));
     }
-  }
-  std::vector<LocalPortGroup> groups;
-  groups.reserve(byLocalPort.size());
-  for (auto &[key, group] : byLocalPort) {
-    groups.push_back(std::move(group));
+    return groups;
   }
 
-  const Clock::time_point deadline = Clock::now() + environment.deadline;
-  std::mutex mutex; // guards results, pending, counts
-  std::atomic<std::size_t> next{0};
-  auto record = [&](std::size_t rule, std::size_t check, CheckResult result) {
-    std::string done;
-    {
-      std::lock_guard<std::mutex> lock(mutex);
-      switch (result.outcome) {
-      case CheckOutcome::kReachable:
-        ++counts.reachable;
-        break;
-      case CheckOutcome::kUnreachable:
-        ++counts.unreachable;
-        break;
-      default:
-        ++counts.noVerdict;
-        break;
+  // Checks the groups on up to mEnvironment.workers threads, this one
+  // included; returns when all are joined.
+  void CheckGroupsInWorkers(const std::vector<LocalPortGroup> &groups,
+                            OutsideProbe &probe) {
+    const Clock::time_point deadline = Clock::now() + mEnvironment.deadline;
+    std::atomic<std::size_t> next{0};
+    auto guarded = [&] {
+      try {
+        CheckNextGroups(groups, next, probe, deadline);
+      } catch (const std::exception &e) {
+        // Nothing may leave a worker; its unfinished checks stay "testing"
+        // and the test fails below.
+        ZARK_PM_LOG_ERROR("port test worker: %s", e.what());
       }
-      ++counts.checks;
-      if (result.outcome != CheckOutcome::kError) {
-        ++counts.answered;
-      }
-      results[rule][check] = std::move(result);
-      if (--pending[rule] == 0) {
-        done = RuleResultText(results[rule]);
-      }
-    }
-    if (!done.empty()) {
-      status.Set(rule, done);
-    }
-  };
-  auto work = [&] {
-    for (;;) {
-      const std::size_t index = next.fetch_add(1);
-      if (index >= groups.size()) {
-        return;
-      }
-      const LocalPortGroup &group = groups[index];
-      std::string token = NewProbeToken();
-      TokenListener listener;
-      TokenListener::OpenResult opened = TokenListener::OpenResult::kFailed;
-      if (!token.empty()) {
-        opened = listener.Open(group.protocol, group.localPort, token);
-      }
-      if (opened == TokenListener::OpenResult::kOpen) {
-        std::lock_guard<std::mutex> lock(mutex);
-        ++counts.listeners;
-      } else {
-        token.clear();
-      }
-      for (const auto &[rule, check] : group.checks) {
-        const PortCheck &port = plans[rule].checks[check];
-        if (opened == TokenListener::OpenResult::kFailed) {
-          record(rule, check,
-                 {CheckOutcome::kError,
-                  "cannot listen on " +
-                      PortText(group.protocol, group.localPort)});
-          continue;
-        }
-        if (Clock::now() >= deadline) {
-          record(rule, check,
-                 {CheckOutcome::kError, "not tested: time limit reached"});
-          continue;
-        }
-        ProbeAnswer answer =
-            probe->Check(port.protocol, port.routerPort, token);
-        if (answer.status == ProbeStatus::kUnreachable) {
-          syslog(LOG_INFO,
-                 "%s:%d port test: rule \"%s\" %s does not answer from "
-                 "outside (%s)",
-                 __FILE__, __LINE__, plans[rule].ruleId.c_str(),
-                 PortText(port.protocol, port.routerPort).c_str(),
-                 answer.reason.c_str());
-        }
-        record(rule, check, CheckResultOf(port, answer, !token.empty()));
-      }
-    }
-  };
-  auto guarded = [&] {
-    try {
-      work();
-    } catch (const std::exception &e) {
-      // Nothing may leave a worker; its unfinished checks stay "testing"
-      // and the test fails below.
-      ZARK_PM_LOG_ERROR("port test worker: %s", e.what());
-    }
-  };
-  {
+    };
     const std::size_t workers =
-        std::min<std::size_t>(std::max(environment.workers, 1), groups.size());
+        std::min<std::size_t>(std::max(mEnvironment.workers, 1), groups.size());
     std::vector<std::jthread> threads;
     for (std::size_t i = 1; i < workers; ++i) {
       threads.emplace_back(guarded);
@@ -433,34 +394,163 @@ int RunPortTest(std::span<const ZARK_ROUTER_RULE> rules,
     guarded();
   } // joined here
 
-  bool unfinished = false;
-  for (std::size_t i = 0; i < plans.size(); ++i) {
-    if (pending[i] > 0) {
-      unfinished = true;
-      status.Set(i, "not tested: internal error");
+  // One worker: takes the groups not yet taken, one at a time.
+  void CheckNextGroups(const std::vector<LocalPortGroup> &groups,
+                       std::atomic<std::size_t> &next, OutsideProbe &probe,
+                       Clock::time_point deadline) {
+    for (;;) {
+      const std::size_t index = next.fetch_add(1);
+      if (index >= groups.size()) {
+        return;
+      }
+      CheckGroup(groups[index], probe, deadline);
     }
   }
-  syslog(LOG_INFO,
-         "%s:%d port test: %d rule(s), %d port(s) checked: %d reachable, %d "
-         "unreachable, %d without a verdict",
-         __FILE__, __LINE__, counts.rules, counts.checks, counts.reachable,
-         counts.unreachable, counts.noVerdict);
-  if (status.WriteFailed()) {
-    ZARK_PM_LOG_ERROR("port test: %s could not be kept up to date",
-                      environment.statusPath.c_str());
-    counts.error = ZARK_PORTMAP_ERR_IO;
-    return -1;
+
+  // Checks the ports of one group behind one listener on its local port,
+  // which answers the probe's token when it could be opened.
+  void CheckGroup(const LocalPortGroup &group, OutsideProbe &probe,
+                  Clock::time_point deadline) {
+    std::string token = NewProbeToken();
+    TokenListener listener;
+    TokenListener::OpenResult opened = TokenListener::OpenResult::kFailed;
+    if (!token.empty()) {
+      opened = listener.Open(group.protocol, group.localPort, token);
+    }
+    if (opened == TokenListener::OpenResult::kOpen) {
+      std::lock_guard<std::mutex> lock(mMutex);
+      ++mCounts.listeners;
+    } else {
+      token.clear();
+    }
+    for (const auto &[rule, check] : group.checks) {
+      const PortCheck &port = mPlans[rule].checks[check];
+      if (opened == TokenListener::OpenResult::kFailed) {
+        Record(
+            rule, check,
+            {CheckOutcome::kError,
+             "cannot listen on " + PortText(group.protocol, group.localPort)});
+        continue;
+      }
+      if (Clock::now() >= deadline) {
+        Record(rule, check,
+               {CheckOutcome::kError, "not tested: time limit reached"});
+        continue;
+      }
+      ProbeAnswer answer = probe.Check(port.protocol, port.routerPort, token);
+      if (answer.status == ProbeStatus::kUnreachable) {
+        syslog(LOG_INFO,
+               "%s:%d port test: rule \"%s\" %s does not answer from "
+               "outside (%s)",
+               __FILE__, __LINE__, mPlans[rule].ruleId.c_str(),
+               PortText(port.protocol, port.routerPort).c_str(),
+               answer.reason.c_str());
+      }
+      Record(rule, check, CheckResultOf(port, answer, !token.empty()));
+    }
   }
-  if (unfinished) {
-    counts.error = ZARK_PORTMAP_ERR_GENERIC;
-    return -1;
+
+  // Counts one finished check and writes its rule's result once the rule's
+  // last check is in.
+  void Record(std::size_t rule, std::size_t check, CheckResult result) {
+    std::string done;
+    {
+      std::lock_guard<std::mutex> lock(mMutex);
+      CountOutcome(result.outcome);
+      mResults[rule][check] = std::move(result);
+      if (--mPending[rule] == 0) {
+        done = RuleResultText(mResults[rule]);
+      }
+    }
+    if (!done.empty()) {
+      mStatus.Set(rule, done);
+    }
   }
-  if (toCheck > 0 && counts.answered == 0) {
-    ZARK_PM_LOG_ERROR("port test: the probe service answered no check");
-    counts.error = ZARK_PORTMAP_ERR_PROBE_SERVICE;
-    return -1;
+
+  // Called with mMutex held.
+  void CountOutcome(CheckOutcome outcome) {
+    switch (outcome) {
+    case CheckOutcome::kReachable:
+      ++mCounts.reachable;
+      break;
+    case CheckOutcome::kUnreachable:
+      ++mCounts.unreachable;
+      break;
+    default:
+      ++mCounts.noVerdict;
+      break;
+    }
+    ++mCounts.checks;
+    if (outcome != CheckOutcome::kError) {
+      ++mCounts.answered;
+    }
   }
-  return 0;
+
+  // Marks the rules whose checks did not all finish; true when there is one.
+  bool MarkUnfinishedRules() {
+    bool unfinished = false;
+    for (std::size_t i = 0; i < mPlans.size(); ++i) {
+      if (mPending[i] > 0) {
+        unfinished = true;
+        mStatus.Set(i, "not tested: internal error");
+      }
+    }
+    return unfinished;
+  }
+
+  void LogSummary() const {
+    syslog(LOG_INFO,
+           "%s:%d port test: %d rule(s), %d port(s) checked: %d reachable, %d "
+           "unreachable, %d without a verdict",
+           __FILE__, __LINE__, mCounts.rules, mCounts.checks, mCounts.reachable,
+           mCounts.unreachable, mCounts.noVerdict);
+  }
+
+  // The result of the test once every check is done: -1, with the error
+  // set, when the status file could not be kept, a check did not finish or
+  // the probe service answered none.
+  int Conclude(bool unfinished) {
+    if (mStatus.WriteFailed()) {
+      ZARK_PM_LOG_ERROR("port test: %s could not be kept up to date",
+                        mEnvironment.statusPath.c_str());
+      mCounts.error = ZARK_PORTMAP_ERR_IO;
+      return -1;
+    }
+    if (unfinished) {
+      mCounts.error = ZARK_PORTMAP_ERR_GENERIC;
+      return -1;
+    }
+    if (mToCheck > 0 && mCounts.answered == 0) {
+      ZARK_PM_LOG_ERROR("port test: the probe service answered no check");
+      mCounts.error = ZARK_PORTMAP_ERR_PROBE_SERVICE;
+      return -1;
+    }
+    return 0;
+  }
+
+  const PortTestEnvironment &mEnvironment;
+  PortTestSummary &mCounts;
+  std::vector<RuleChecks> mPlans;
+  StatusFile mStatus;
+  // Results per rule, filled as checks finish; the checks still to finish.
+  std::vector<std::vector<CheckResult>> mResults;
+  std::vector<std::size_t> mPending;
+  int mToCheck = 0;
+  std::mutex mMutex; // guards mResults, mPending, mCounts
+};
+
+} // namespace
+
+int RunPortTest(std::span<const ZARK_ROUTER_RULE> rules,
+                const PortTestEnvironment &environment,
+                PortTestSummary *summary) {
+  PortTestSummary local;
+  PortTestSummary &counts = summary != nullptr ? *summary : local;
+  counts = PortTestSummary{};
+  std::vector<RuleChecks> plans = PlanEnabledRules(rules);
+  counts.rules = static_cast<int>(plans.size());
+  PortTestRun run(std::move(plans), environment, counts);
+  return run.Run();
 }
 
 } // namespace zark::portmap
