@@ -45,9 +45,9 @@
 // 20 ms is what netem's 10 ms on the router's LAN link (on the packets from
 // the router) would cost a request over a new connection, as miniupnpc
 // makes one per request: its SYN-ACK and its reply each come 10 ms late.
-#include "base/child_process.h"
 #include "base/unique_fd.h"
 #include "catalog/mapping_state.h"
+#include "child_process.h"
 #include "counting_relay.h"
 #include "hermetic.h"
 #include "libzarkportmap.h"
@@ -86,10 +86,10 @@ namespace {
 using Clock = std::chrono::steady_clock;
 using zark::bench::CountingRelay;
 using zark::bench::RelayCounts;
-using zark::portmap::ChildOptions;
-using zark::portmap::ChildResult;
-using zark::portmap::RunProgram;
 using zark::portmap::UniqueFd;
+using zark::test::ChildOptions;
+using zark::test::ChildResult;
+using zark::test::RunProgram;
 using zark::testnet::TestNetwork;
 
 constexpr int kRules = 100; // each for TCP and UDP

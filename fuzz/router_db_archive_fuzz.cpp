@@ -1,41 +1,27 @@
-// Fuzz target of the router database archive check (CheckArchiveListing):
-// the verbose listing tar prints for a downloaded archive, which decides
-// whether the archive is unpacked at all. Besides not crashing:
+// Fuzz target of the router database archive check (CheckRouterDbArchive):
+// the bytes of a downloaded archive, plain or compressed tar, whose member
+// headers decide whether it is unpacked at all. Besides not crashing:
 // - a refusal has a reason;
-// - in an accepted listing every member line names a path under
-//   "routerdb/" without a "." or ".." component, and is a folder or a
-//   regular file (checked here independently of the parser, on the last
-//   field of each line).
+// - an accepted archive reads to its end when libarchive lists it on its
+//   own, and every member is a folder or a regular file named "routerdb"
+//   or below "routerdb/" without a "." or ".." component (checked here on
+//   the names the listing gives, independently of the check).
 #include "catalog/router_db_archive.h"
+#include "db_test_support.h"
 #include "fuzz_support.h"
 #include "syslog_capture.h"
 
 #include <cstddef>
 #include <cstdint>
 #include <string>
+#include <vector>
 
 namespace {
 
 using zark::fuzz::Require;
 
-// The name of a listing line: what follows the blank after the fifth
-// blank-separated field, the time
-// ("-rw-r--r-- 0/0  74 2024-05-01 12:00 routerdb/routerdb.conf").
-std::string_view NameOf(std::string_view line) {
-  std::size_t at = 0;
-  for (int field = 0; field < 5; ++field) {
-    while (at < line.size() && line[at] == ' ') {
-      ++at;
-    }
-    while (at < line.size() && line[at] != ' ') {
-      ++at;
-    }
-  }
-  return at < line.size() ? line.substr(at + 1) : std::string_view();
-}
-
 bool SafeName(std::string_view name) {
-  if (name.rfind("routerdb/", 0) != 0) {
+  if (name != "routerdb" && name.rfind("routerdb/", 0) != 0) {
     return false;
   }
   std::size_t start = 0;
@@ -61,23 +47,22 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   // Log lines are captured (tests/support/syslog_capture.h); keep only
   // this input's.
   zark::test::ClearLogs();
-  const std::string_view listing = zark::fuzz::AsText(data, size);
+  const std::string_view archive = zark::fuzz::AsText(data, size);
   std::string why;
-  if (!zark::portmap::CheckArchiveListing(listing, why)) {
+  if (!zark::portmap::CheckRouterDbArchive(archive, why)) {
     Require(!why.empty(), "a refusal without a reason");
     return 0;
   }
-  zark::fuzz::InputReader lines(listing);
-  while (!lines.Empty()) {
-    const std::string_view line = lines.Piece("\n");
-    if (line.empty()) {
-      continue;
-    }
-    Require(line.front() == 'd' || line.front() == '-',
+  std::vector<zark::test::ListedMember> members;
+  Require(zark::test::ListTarMembers(archive, members),
+          "an accepted archive that does not read to its end");
+  Require(!members.empty(), "an accepted archive without members");
+  for (const zark::test::ListedMember &member : members) {
+    Require(member.type == 'd' || member.type == '-',
             "an accepted member that is neither folder nor file: " +
-                std::string(line));
-    Require(SafeName(NameOf(line)),
-            "an accepted member outside routerdb/: " + std::string(line));
+                member.name);
+    Require(SafeName(member.name),
+            "an accepted member outside routerdb/: " + member.name);
   }
   return 0;
 }

@@ -1,10 +1,13 @@
 #include "host_options.h"
 
 #include <arpa/inet.h>
+#include <getopt.h>
 
+#include <algorithm>
 #include <charconv>
 #include <cstdint>
 #include <optional>
+#include <vector>
 
 #ifndef ZARK_DEFAULT_MODULES_DIR
 #define ZARK_DEFAULT_MODULES_DIR "/usr/lib/zark/modules"
@@ -74,87 +77,137 @@ bool ParseListen(std::string_view text, std::string &address, int &port) {
   return true;
 }
 
+ArgumentVector::ArgumentVector(std::string_view program,
+                               std::span<const std::string> args) {
+  mWords.reserve(args.size() + 1);
+  mWords.emplace_back(program);
+  mWords.insert(mWords.end(), args.begin(), args.end());
+  for (std::string &word : mWords) {
+    mPointers.push_back(word.data());
+  }
+  mPointers.push_back(nullptr);
+}
+
+std::string RefusedOption(int got, char *const *argv) {
+  // An unknown short option is optopt; otherwise getopt_long has stepped
+  // past the element that holds the option.
+  if (got == '?' && optopt > 0 && optopt < 256) {
+    return std::string("-") + static_cast<char>(optopt);
+  }
+  std::string written = argv[optind - 1];
+  written.resize(std::min(written.find('='), written.size()));
+  return written;
+}
+
 OptionsResult ParseHostOptions(std::span<const std::string> args,
                                HostOptions &options, std::string &error) {
   options.http.wwwFolder = DefaultWwwFolder();
-  for (std::size_t i = 0; i < args.size(); ++i) {
-    std::string name = args[i];
-    std::optional<std::string> value;
-    if (std::size_t equals = name.find('='); equals != std::string::npos) {
-      value = name.substr(equals + 1);
-      name.resize(equals);
+  // Values of getopt_long for the options without a short form.
+  enum : int {
+    kListen = 256,
+    kModules,
+    kAccounts,
+    kWww,
+    kThreads,
+    kSessionIdle,
+    kSessionMax,
+    kSecureCookie,
+  };
+  static const option kOptions[] = {
+      {"help", no_argument, nullptr, 'h'},
+      {"listen", required_argument, nullptr, kListen},
+      {"modules", required_argument, nullptr, kModules},
+      {"accounts", required_argument, nullptr, kAccounts},
+      {"www", required_argument, nullptr, kWww},
+      {"threads", required_argument, nullptr, kThreads},
+      {"session-idle", required_argument, nullptr, kSessionIdle},
+      {"session-max", required_argument, nullptr, kSessionMax},
+      {"secure-cookie", no_argument, nullptr, kSecureCookie},
+      {nullptr, 0, nullptr, 0},
+  };
+  ArgumentVector arguments("zark-webapid", args);
+  char **argv = arguments.Get();
+  const int argc = arguments.Count();
+  // optind 0 makes GNU getopt start over: the options may be parsed more
+  // than once in a process (the tests do). "+": stop at the first
+  // argument that is no option; ":": report a missing value apart.
+  optind = 0;
+  opterr = 0;
+  for (;;) {
+    int index = -1;
+    const int got = getopt_long(argc, argv, "+:h", kOptions, &index);
+    if (got == -1) {
+      break;
     }
-    auto takeValue = [&]() -> std::optional<std::string> {
-      if (value) {
-        return value;
-      }
-      if (i + 1 < args.size()) {
-        return args[++i];
-      }
-      error = name + " needs a value";
-      return std::nullopt;
-    };
+    const std::string name =
+        index >= 0 ? "--" + std::string(kOptions[index].name) : std::string();
     auto seconds =
-        [&](const std::string &text,
-            std::int64_t max) -> std::optional<std::chrono::milliseconds> {
-      std::optional<std::int64_t> number = ParseNumber(text, 1, max);
+        [&](std::int64_t max) -> std::optional<std::chrono::milliseconds> {
+      std::optional<std::int64_t> number = ParseNumber(optarg, 1, max);
       if (!number) {
         error = name + " takes whole seconds, 1 to " + std::to_string(max);
         return std::nullopt;
       }
       return std::chrono::seconds(*number);
     };
-
-    if (name == "--help" || name == "-h") {
+    switch (got) {
+    case 'h':
       return OptionsResult::Help;
-    }
-    if (name == "--secure-cookie") {
-      options.secureCookie = true;
-      continue;
-    }
-    std::optional<std::string> text;
-    if (name == "--listen" || name == "--modules" || name == "--accounts" ||
-        name == "--www" || name == "--threads" || name == "--session-idle" ||
-        name == "--session-max") {
-      text = takeValue();
-      if (!text) {
-        return OptionsResult::Error;
-      }
-    } else {
-      error = "unknown option " + name;
+    case ':':
+      error = RefusedOption(got, argv) + " needs a value";
       return OptionsResult::Error;
-    }
-    if (name == "--listen") {
-      if (!ParseListen(*text, options.http.address, options.http.port)) {
+    case kSecureCookie:
+      options.secureCookie = true;
+      break;
+    case kListen:
+      if (!ParseListen(optarg, options.http.address, options.http.port)) {
         error = "--listen takes ADDRESS:PORT, for example 127.0.0.1:5000";
         return OptionsResult::Error;
       }
-    } else if (name == "--modules") {
-      options.modulesFolder = *text;
-    } else if (name == "--accounts") {
-      options.accountsFile = *text;
-    } else if (name == "--www") {
-      options.http.wwwFolder = *text;
-    } else if (name == "--threads") {
-      std::optional<std::int64_t> number = ParseNumber(*text, 1, 256);
+      break;
+    case kModules:
+      options.modulesFolder = optarg;
+      break;
+    case kAccounts:
+      options.accountsFile = optarg;
+      break;
+    case kWww:
+      options.http.wwwFolder = optarg;
+      break;
+    case kThreads: {
+      std::optional<std::int64_t> number = ParseNumber(optarg, 1, 256);
       if (!number) {
         error = "--threads takes 1 to 256";
         return OptionsResult::Error;
       }
       options.http.threads = static_cast<std::size_t>(*number);
-    } else if (name == "--session-idle") {
-      auto idle = seconds(*text, 7 * 24 * 3600);
+      break;
+    }
+    case kSessionIdle: {
+      auto idle = seconds(7 * 24 * 3600);
       if (!idle) {
         return OptionsResult::Error;
       }
       options.sessions.idleTimeout = *idle;
-    } else if (name == "--session-max") {
-      auto max = seconds(*text, 30 * 24 * 3600);
+      break;
+    }
+    case kSessionMax: {
+      auto max = seconds(30 * 24 * 3600);
       if (!max) {
         return OptionsResult::Error;
       }
       options.sessions.maxLifetime = *max;
+      break;
     }
+    default:
+      error = "unknown option " + RefusedOption(got, argv);
+      return OptionsResult::Error;
+    }
+  }
+  // The host takes no arguments besides its options.
+  if (optind < argc) {
+    error = "unknown option " + std::string(argv[optind]);
+    return OptionsResult::Error;
   }
   return OptionsResult::Run;
 }

@@ -5,6 +5,7 @@
 #include "host_options.h"
 #include "password_hash.h"
 
+#include <getopt.h>
 #include <string.h>
 #include <termios.h>
 
@@ -87,33 +88,39 @@ int RunPasswdCommand(std::span<const std::string> args, PasswordInput input,
   std::optional<std::string> user;
   std::filesystem::path file = DefaultAccountsFile();
   std::string group(kAdminGroup);
-  for (std::size_t i = 0; i < args.size(); ++i) {
-    std::string name = args[i];
-    std::optional<std::string> value;
-    if (std::size_t equals = name.find('=');
-        name.rfind("--", 0) == 0 && equals != std::string::npos) {
-      value = name.substr(equals + 1);
-      name.resize(equals);
+  enum : int { kAccounts = 256, kGroup };
+  static const option kOptions[] = {
+      {"accounts", required_argument, nullptr, kAccounts},
+      {"group", required_argument, nullptr, kGroup},
+      {nullptr, 0, nullptr, 0},
+  };
+  ArgumentVector arguments("passwd", args);
+  char **argv = arguments.Get();
+  const int argc = arguments.Count();
+  // optind 0 makes GNU getopt start over (the tests run the command more
+  // than once); options may come before or after the user's name.
+  optind = 0;
+  opterr = 0;
+  for (;;) {
+    const int got = getopt_long(argc, argv, ":", kOptions, nullptr);
+    if (got == -1) {
+      break;
     }
-    if (name == "--accounts" || name == "--group") {
-      if (!value) {
-        if (i + 1 >= args.size()) {
-          return Usage(err, name + " needs a value");
-        }
-        value = args[++i];
-      }
-      if (name == "--accounts") {
-        file = *value;
-      } else {
-        group = *value;
-      }
-    } else if (name.rfind('-', 0) == 0) {
-      return Usage(err, "unknown option " + name);
-    } else if (!user) {
-      user = name;
+    if (got == kAccounts) {
+      file = optarg;
+    } else if (got == kGroup) {
+      group = optarg;
+    } else if (got == ':') {
+      return Usage(err, RefusedOption(got, argv) + " needs a value");
     } else {
+      return Usage(err, "unknown option " + RefusedOption(got, argv));
+    }
+  }
+  for (int i = optind; i < argc; ++i) {
+    if (user) {
       return Usage(err, "one user at a time");
     }
+    user = argv[i];
   }
   if (!user) {
     return Usage(err, "no user named");

@@ -90,15 +90,14 @@ set(CPACK_DEBIAN_FILE_NAME DEB-DEFAULT)
 set(CPACK_DEBIAN_PACKAGE_SECTION net)
 set(CPACK_DEBIAN_PACKAGE_PRIORITY optional)
 # The shared libraries the programs need (objdump -p: NEEDED) in Debian 12,
-# with the versions dpkg-shlibdeps gives for this build, and tar, which
-# unpacks router database updates (Essential, listed all the same).
+# with the versions dpkg-shlibdeps gives for this build.
 # libcpp-httplib0.11 brings OpenSSL, zlib and brotli itself.
 set(CPACK_DEBIAN_PACKAGE_DEPENDS
     "libc6 (>= 2.34), libstdc++6 (>= 12), libgcc-s1 (>= 3.0), \
 libjsoncpp25 (>= 1.9.5), libminiupnpc17 (>= 2.0.20171212), \
 libnatpmp1 (>= 20150609), libcpp-httplib0.11 (>= 0.11.4+ds), \
 libcrypt1 (>= 1:4.1.0), libexpat1 (>= 2.5.0), libc-ares2 (>= 1.18.1), \
-libarchive13 (>= 3.6.2), tar")
+libarchive13 (>= 3.6.2)")
 # Debug information stays in the build folder.
 set(CPACK_STRIP_FILES TRUE)
 set(CPACK_DEBIAN_PACKAGE_RECOMMENDS "systemd")

@@ -3,6 +3,7 @@
 #include "connect_back.h"
 #include "probe_server.h"
 
+#include <getopt.h>
 #include <signal.h>
 
 #include <charconv>
@@ -62,64 +63,120 @@ int main(int argc, char **argv) {
   CheckTimeouts timeouts;
   bool quiet = false;
   bool listenGiven = false;
-  for (int i = 1; i < argc; ++i) {
-    const std::string_view arg = argv[i];
-    if (arg == "--help" || arg == "-h") {
+  // Values of getopt_long for the options without a short form.
+  enum : int {
+    kQuiet = 256,
+    kListen,
+    kRate,
+    kBurst,
+    kMaxSessions,
+    kMaxPerAddress,
+    kMaxRequests,
+    kIdleTimeout,
+    kConnectTimeout,
+    kAnswerTimeout,
+  };
+  static const option kOptions[] = {
+      {"help", no_argument, nullptr, 'h'},
+      {"quiet", no_argument, nullptr, kQuiet},
+      {"listen", required_argument, nullptr, kListen},
+      {"rate", required_argument, nullptr, kRate},
+      {"burst", required_argument, nullptr, kBurst},
+      {"max-sessions", required_argument, nullptr, kMaxSessions},
+      {"max-per-address", required_argument, nullptr, kMaxPerAddress},
+      {"max-requests", required_argument, nullptr, kMaxRequests},
+      {"idle-timeout", required_argument, nullptr, kIdleTimeout},
+      {"connect-timeout", required_argument, nullptr, kConnectTimeout},
+      {"answer-timeout", required_argument, nullptr, kAnswerTimeout},
+      {nullptr, 0, nullptr, 0},
+  };
+  // "+": stop at the first argument that is no option; ":": report a
+  // missing value apart. getopt_long's own messages stay off.
+  opterr = 0;
+  for (;;) {
+    int index = -1;
+    const int got = getopt_long(argc, argv, "+:h", kOptions, &index);
+    if (got == -1) {
+      break;
+    }
+    if (got == 'h') {
       PrintUsage(stdout);
       return 0;
     }
-    if (arg == "--quiet") {
-      quiet = true;
-      continue;
-    }
-    if (i + 1 >= argc) {
-      std::fprintf(stderr, "zark-probed: %s needs a value\n", argv[i]);
+    if (got == ':' || got == '?') {
+      // getopt_long has stepped past the element holding the option, or
+      // names an unknown short one in optopt.
+      std::string written = argv[optind - 1];
+      if (got == '?' && optopt > 0 && optopt < 256) {
+        written = std::string("-") + static_cast<char>(optopt);
+      }
+      std::fprintf(stderr,
+                   got == ':' ? "zark-probed: %s needs a value\n"
+                              : "zark-probed: unknown option %s\n",
+                   written.substr(0, written.find('=')).c_str());
       PrintUsage(stderr);
       return 2;
     }
-    const std::string_view value = argv[++i];
+    const std::string_view value = optarg != nullptr ? optarg : "";
     long long number = 0;
     bool ok = true;
-    if (arg == "--listen") {
+    switch (got) {
+    case kQuiet:
+      quiet = true;
+      break;
+    case kListen:
       if (!listenGiven) {
         options.listen.clear();
         listenGiven = true;
       }
       options.listen.emplace_back(value);
-    } else if (arg == "--rate") {
+      break;
+    case kRate:
       ok = ParseNumber(value, 1, 100000, number);
       options.ratePerSecond = static_cast<double>(number);
-    } else if (arg == "--burst") {
+      break;
+    case kBurst:
       ok = ParseNumber(value, 1, 100000, number);
       options.burst = static_cast<double>(number);
-    } else if (arg == "--max-sessions") {
+      break;
+    case kMaxSessions:
       ok = ParseNumber(value, 1, 10000, number);
       options.maxSessions = static_cast<int>(number);
-    } else if (arg == "--max-per-address") {
+      break;
+    case kMaxPerAddress:
       ok = ParseNumber(value, 1, 10000, number);
       options.maxSessionsPerAddress = static_cast<int>(number);
-    } else if (arg == "--max-requests") {
+      break;
+    case kMaxRequests:
       ok = ParseNumber(value, 1, 100000, number);
       options.maxRequestsPerSession = static_cast<int>(number);
-    } else if (arg == "--idle-timeout") {
+      break;
+    case kIdleTimeout:
       ok = ParseNumber(value, 1, 600000, number);
       options.idleTimeout = std::chrono::milliseconds(number);
-    } else if (arg == "--connect-timeout") {
+      break;
+    case kConnectTimeout:
       ok = ParseNumber(value, 1, 60000, number);
       timeouts.connect = std::chrono::milliseconds(number);
-    } else if (arg == "--answer-timeout") {
+      break;
+    case kAnswerTimeout:
       ok = ParseNumber(value, 1, 60000, number);
       timeouts.answer = std::chrono::milliseconds(number);
-    } else {
-      std::fprintf(stderr, "zark-probed: unknown option %s\n", argv[i - 1]);
-      PrintUsage(stderr);
-      return 2;
+      break;
+    default:
+      break;
     }
     if (!ok) {
-      std::fprintf(stderr, "zark-probed: bad value \"%s\" for %s\n", argv[i],
-                   argv[i - 1]);
+      std::fprintf(stderr, "zark-probed: bad value \"%s\" for --%s\n", optarg,
+                   kOptions[index].name);
       return 2;
     }
+  }
+  // The service takes no arguments besides its options.
+  if (optind < argc) {
+    std::fprintf(stderr, "zark-probed: unknown option %s\n", argv[optind]);
+    PrintUsage(stderr);
+    return 2;
   }
 
   // Blocked before any thread starts, so that every thread inherits the

@@ -63,7 +63,9 @@ TEST(HostOptions, BadValuesAreErrors) {
         {"--threads", "many"},
         {"--session-idle", "0"},
         {"--session-idle"},
-        {"--bogus"}}) {
+        {"--bogus"},
+        {"-x"},
+        {"stray"}}) {
     Parsed parsed = Parse(args);
     EXPECT_EQ(parsed.result, OptionsResult::Error) << args[0];
     EXPECT_FALSE(parsed.error.empty());
@@ -72,6 +74,7 @@ TEST(HostOptions, BadValuesAreErrors) {
 
 TEST(HostOptions, HelpIsAsked) {
   EXPECT_EQ(Parse({"--help"}).result, OptionsResult::Help);
+  EXPECT_EQ(Parse({"-h"}).result, OptionsResult::Help);
   EXPECT_NE(HostUsage("zark-webapid").find("--listen"), std::string::npos);
 }
 

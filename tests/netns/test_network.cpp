@@ -1,6 +1,6 @@
 #include "test_network.h"
 
-#include "base/child_process.h"
+#include "child_process.h"
 
 #include <arpa/inet.h>
 #include <fcntl.h>
@@ -375,10 +375,10 @@ bool UpnpMapping::operator<(const UpnpMapping &other) const {
 
 int RunTool(const std::vector<std::string> &args, std::string &output,
             std::chrono::milliseconds timeout) {
-  zark::portmap::ChildOptions options;
+  zark::test::ChildOptions options;
   options.timeout = timeout;
-  zark::portmap::ChildResult result =
-      zark::portmap::RunProgram(args.at(0), args, options);
+  zark::test::ChildResult result =
+      zark::test::RunProgram(args.at(0), args, options);
   output = result.output + result.errors;
   if (!result.started || !result.exited || result.timedOut) {
     return -1;

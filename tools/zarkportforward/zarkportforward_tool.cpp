@@ -4,6 +4,8 @@
 #include "drivers/driver_choice.h"
 #include "libzarkportmap.h"
 
+#include <getopt.h>
+
 #include <memory>
 #include <vector>
 
@@ -205,11 +207,41 @@ int RunZarkPortForward(std::span<const std::string> args, std::ostream &out,
     err << Usage();
     return kToolUsage;
   }
-  const std::string command = args.empty() ? std::string() : args[0];
-  if (command == "--help" || command == "-h") {
-    out << Usage();
-    return kToolOk;
+  static const option kOptions[] = {
+      {"help", no_argument, nullptr, 'h'},
+      {nullptr, 0, nullptr, 0},
+  };
+  // getopt_long wants writable strings and the program's name first.
+  std::vector<std::string> words(args.begin(), args.end());
+  std::string program = "zarkportforward";
+  std::vector<char *> argv = {program.data()};
+  for (std::string &word : words) {
+    argv.push_back(word.data());
   }
+  argv.push_back(nullptr);
+  const int argc = static_cast<int>(argv.size()) - 1;
+  // optind 0 makes GNU getopt start over: the tool runs more than once in
+  // a test process. "+": the command is no option and ends them.
+  optind = 0;
+  opterr = 0;
+  for (int got = 0;
+       (got = getopt_long(argc, argv.data(), "+h", kOptions, nullptr)) != -1;) {
+    if (got == 'h') {
+      out << Usage();
+      return kToolOk;
+    }
+    err << "zarkportforward: unknown argument \"" << args[0] << "\"\n"
+        << Usage();
+    return kToolUsage;
+  }
+  // "--" alone ends the options and names no command: refused as it always
+  // was, rather than read as "apply".
+  if (!args.empty() && optind >= argc) {
+    err << "zarkportforward: unknown argument \"" << args[0] << "\"\n"
+        << Usage();
+    return kToolUsage;
+  }
+  const std::string command = optind < argc ? argv[optind] : std::string();
   if (!command.empty() && command != "renew" && command != "list") {
     err << "zarkportforward: unknown argument \"" << command << "\"\n"
         << Usage();

@@ -1,7 +1,8 @@
-// Router database archives: a tar file (plain, gzip, bzip2 or xz, as GNU tar
-// recognises it) whose members all lie under "routerdb/" and are folders or
-// regular files. It is unpacked by /bin/tar, run without a shell, after its
-// listing passed the checks below.
+// Router database archives: a tar file (plain, or compressed with gzip,
+// bzip2, xz, lzma, lzip, zstd or compress) whose members all lie under
+// "routerdb/" and are folders or regular files. libarchive reads it in this
+// process: a first pass checks every member's header without writing
+// anything, a second unpacks the members, checked again as they come.
 #ifndef ZARK_PORTMAP_ROUTER_DB_ARCHIVE_H
 #define ZARK_PORTMAP_ROUTER_DB_ARCHIVE_H
 
@@ -11,29 +12,32 @@
 
 namespace zark::portmap {
 
-inline constexpr const char *kTarProgram = "/bin/tar";
 // Bounds of an archive's content: members, bytes of all files together,
 // bytes of one file.
 inline constexpr std::size_t kMaxArchiveMembers = 20000;
 inline constexpr std::size_t kMaxArchiveBytes = 16u * 1024u * 1024u;
 inline constexpr std::size_t kMaxArchiveFileBytes = 1024u * 1024u;
+// Bytes of a member's name: keeps every unpacked path far below PATH_MAX.
+inline constexpr std::size_t kMaxArchiveNameBytes = 1024;
+// Bytes of the uncompressed tar stream (headers, long names, contents,
+// padding) read at most: bounds the work a hostile archive can cause,
+// whatever its compression.
+inline constexpr std::size_t kMaxArchiveStreamBytes = 64u * 1024u * 1024u;
 
-// Checks the verbose listing of an archive, as
-//   LC_ALL=C tar --list --verbose --numeric-owner --file ARCHIVE
-// prints it, one member a line:
-//   drwxr-xr-x 0/0               0 2024-05-01 12:00 routerdb/
-//   -rw-r--r-- 0/0              74 2024-05-01 12:00 routerdb/routerdb.conf
-// True when every member is a folder ("d") or a regular file ("-") whose
-// name starts with "routerdb/" (or is "routerdb/") and has no "." or ".."
-// component, and the bounds above hold. Otherwise false with why set.
-// Pure: no file access.
-[[nodiscard]] bool CheckArchiveListing(std::string_view listing,
-                                       std::string &why);
+// Checks an archive held in memory without unpacking it. True when it is a
+// tar archive (compressed or not, as above) that reads to its end, holds at
+// least one member, every member is a folder or a regular file (no link,
+// device or FIFO) whose name is "routerdb/" or lies below it with no empty,
+// "." or ".." component, and the bounds above hold. Otherwise false with why
+// set. Pure: no file access.
+[[nodiscard]] bool CheckRouterDbArchive(std::string_view archive,
+                                        std::string &why);
 
-// Unpacks archive into the existing empty folder (which then holds
-// "routerdb/"), after CheckArchiveListing approved its listing. Owners and
-// modes of the archive are not kept. tar gets a deadline and a file size
-// limit. False, logged, when the archive is refused or tar fails.
+// Unpacks the archive file into the existing empty folder (which then holds
+// "routerdb/") when the checks of CheckRouterDbArchive pass on it. Owners
+// and the set-id bits of the archive are not kept; the umask applies.
+// False, logged, when the archive is refused or unpacking fails; what was
+// unpacked before a failure stays in folder, for the caller to remove.
 [[nodiscard]] bool ExtractRouterDbArchive(const std::string &archive,
                                           const std::string &folder);
 

@@ -190,8 +190,8 @@ bool NormaliseModes(const std::string &root) {
     } else if (status.type() == fs::file_type::regular) {
       mode = 0644;
     } else {
-      // tar was told to take only folders and files; anything else means
-      // the archive was not what its listing said.
+      // Only folders and files were unpacked; anything else means the
+      // tree changed under us.
       ZARK_PM_LOG_ERROR("%s is neither a folder nor a regular file",
                         it->path().c_str());
       return false;

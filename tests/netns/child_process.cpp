@@ -1,4 +1,4 @@
-#include "base/child_process.h"
+#include "child_process.h"
 
 #include "base/portmap_log.h"
 #include "base/unique_fd.h"
@@ -13,9 +13,10 @@
 #include <cerrno>
 #include <climits>
 
-namespace zark::portmap {
+namespace zark::test {
 namespace {
 
+using zark::portmap::UniqueFd;
 using Clock = std::chrono::steady_clock;
 
 constexpr std::size_t kMaxErrors = 4096;
@@ -214,4 +215,4 @@ ChildResult RunProgram(const std::string &program,
   return result;
 }
 
-} // namespace zark::portmap
+} // namespace zark::test

@@ -1,15 +1,16 @@
-// Running a helper program without a shell: fork and execve with an argument
-// vector, a clean environment, no inherited descriptors, output captured up
-// to a bound, and a deadline after which the program is killed.
-#ifndef ZARK_PORTMAP_CHILD_PROCESS_H
-#define ZARK_PORTMAP_CHILD_PROCESS_H
+// Test helper (the test network, benchmarks): running a program without a
+// shell: fork and execve with an argument vector, a clean environment, no
+// inherited descriptors, output captured up to a bound, and a deadline after
+// which the program is killed.
+#ifndef ZARK_TESTS_CHILD_PROCESS_H
+#define ZARK_TESTS_CHILD_PROCESS_H
 
 #include <chrono>
 #include <cstddef>
 #include <string>
 #include <vector>
 
-namespace zark::portmap {
+namespace zark::test {
 
 struct ChildOptions {
   std::chrono::milliseconds timeout{30000};
@@ -44,6 +45,6 @@ struct ChildResult {
                                      const std::vector<std::string> &args,
                                      const ChildOptions &options);
 
-} // namespace zark::portmap
+} // namespace zark::test
 
 #endif
