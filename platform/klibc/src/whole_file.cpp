@@ -1,6 +1,8 @@
 #include "whole_file.h"
 
 #include "error_state.h"
+#include "klibc_fd.h"
+#include "klibc_file.h"
 
 #include <fcntl.h>
 #include <unistd.h>
@@ -11,29 +13,6 @@
 
 namespace zark::klibc {
 namespace {
-
-class UniqueFd {
-public:
-  explicit UniqueFd(int fd) : mFd(fd) {}
-  ~UniqueFd() { (void)Close(); }
-  UniqueFd(const UniqueFd &) = delete;
-  UniqueFd &operator=(const UniqueFd &) = delete;
-
-  [[nodiscard]] int Get() const { return mFd; }
-  [[nodiscard]] bool Valid() const { return mFd >= 0; }
-  // Closes now and tells whether the close succeeded (it can report a
-  // delayed write error).
-  [[nodiscard]] bool Close() {
-    if (mFd < 0) {
-      return true;
-    }
-    const int fd = std::exchange(mFd, -1);
-    return close(fd) == 0;
-  }
-
-private:
-  int mFd;
-};
 
 // A temporary file, removed again unless the rename took it over. The
 // path is complete before the file is made, so that nothing can fail (or
@@ -63,20 +42,6 @@ private:
   std::string mPath;
   bool mCreated = false;
 };
-
-[[nodiscard]] bool WriteAll(int fd, std::string_view content) {
-  while (!content.empty()) {
-    const ssize_t written = write(fd, content.data(), content.size());
-    if (written < 0) {
-      if (errno == EINTR) {
-        continue;
-      }
-      return false;
-    }
-    content.remove_prefix(static_cast<std::size_t>(written));
-  }
-  return true;
-}
 
 } // namespace
 

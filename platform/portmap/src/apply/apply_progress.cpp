@@ -3,6 +3,8 @@
 #include "base/portmap_log.h"
 #include "base/unique_fd.h"
 
+#include "klibc_file.h"
+
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -14,20 +16,6 @@
 namespace zark::portmap {
 namespace {
 
-bool WriteAll(int fd, std::string_view data) {
-  while (!data.empty()) {
-    ssize_t written = ::write(fd, data.data(), data.size());
-    if (written < 0) {
-      if (errno == EINTR) {
-        continue;
-      }
-      return false;
-    }
-    data.remove_prefix(static_cast<std::size_t>(written));
-  }
-  return true;
-}
-
 // Replaces path by a new file holding text: a temporary file beside it,
 // renamed over it. Not flushed to disk: progress is worth nothing after a
 // crash. rename() replaces a symlink at path rather than following it.
@@ -38,7 +26,7 @@ bool ReplaceProgressFile(const std::string &path, std::string_view text) {
     ZARK_PM_LOG_CALL("mkostemp", -1, errno, temp.c_str());
     return false;
   }
-  bool ok = ::fchmod(fd.Get(), 0644) == 0 && WriteAll(fd.Get(), text);
+  bool ok = ::fchmod(fd.Get(), 0644) == 0 && klibc::WriteAll(fd.Get(), text);
   int savedErrno = errno;
   if (::close(fd.Release()) != 0 && ok) {
     ok = false;

@@ -3,6 +3,8 @@
 #include "base/portmap_log.h"
 #include "base/unique_fd.h"
 
+#include "klibc_file.h"
+
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -13,20 +15,6 @@
 
 namespace zark::portmap {
 namespace {
-
-bool WriteAll(int fd, std::string_view data) {
-  while (!data.empty()) {
-    ssize_t written = ::write(fd, data.data(), data.size());
-    if (written < 0) {
-      if (errno == EINTR) {
-        continue;
-      }
-      return false;
-    }
-    data.remove_prefix(static_cast<std::size_t>(written));
-  }
-  return true;
-}
 
 // Removes the temporary file unless it was renamed into place.
 class TempFileGuard {
@@ -168,7 +156,7 @@ bool ReplaceFileAtomically(const std::string &path, std::string_view content,
     ZARK_PM_LOG_CALL("fchmod", -1, errno, tempPath.c_str());
     return false;
   }
-  if (!WriteAll(fd.Get(), content)) {
+  if (!klibc::WriteAll(fd.Get(), content)) {
     ZARK_PM_LOG_CALL("write", -1, errno, tempPath.c_str());
     return false;
   }
