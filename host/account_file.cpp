@@ -3,7 +3,7 @@
 #include "host_log.h"
 
 #include "klibc_fd.h"
-#include "klibc_file.h"
+#include "klibc_replace.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -247,44 +247,43 @@ bool StoreAccount(const std::filesystem::path &file, const Account &account,
     content += '\n';
   }
 
-  std::filesystem::path folder = file.parent_path();
-  if (folder.empty()) {
-    folder = ".";
+  klibc::ReplaceOptions options;
+  options.mode = 0600;
+  options.tempName = klibc::TempName::kBesidePath;
+  const std::optional<klibc::ReplaceFailure> failure =
+      klibc::ReplaceFile(file.string(), content, options);
+  // The rename reaches the disk with the folder; the new file is in place
+  // even when the folder cannot be flushed.
+  if (klibc::FileWasReplaced(failure)) {
+    return true;
   }
-  std::string temp = file.string() + ".XXXXXX";
-  klibc::UniqueFd out(mkostemp(temp.data(), O_CLOEXEC));
-  if (!out.Valid()) {
-    error = "cannot create a temporary file beside " + file.string() + ": " +
-            ErrnoText(errno);
-    return false;
+  const std::string &temp = failure->tempPath;
+  std::string what;
+  switch (failure->step) {
+  case klibc::ReplaceStep::kCreateTemp:
+    what = "cannot create a temporary file beside " + file.string();
+    break;
+  case klibc::ReplaceStep::kSetMode:
+  case klibc::ReplaceStep::kSetOwner:
+    what = "cannot set mode 0600 on " + temp;
+    break;
+  case klibc::ReplaceStep::kWrite:
+    what = "cannot write " + temp;
+    break;
+  case klibc::ReplaceStep::kFlush:
+    what = "cannot flush " + temp;
+    break;
+  case klibc::ReplaceStep::kClose:
+    what = "cannot close " + temp;
+    break;
+  case klibc::ReplaceStep::kRename:
+  case klibc::ReplaceStep::kOpenFolder:
+  case klibc::ReplaceStep::kFlushFolder:
+    what = "cannot rename " + temp + " to " + file.string();
+    break;
   }
-  auto fail = [&](const std::string &what, int code) {
-    error = what + ": " + ErrnoText(code);
-    (void)out.Close();
-    unlink(temp.c_str());
-    return false;
-  };
-  if (fchmod(out.Get(), 0600) != 0) {
-    return fail("cannot set mode 0600 on " + temp, errno);
-  }
-  if (!klibc::WriteAll(out.Get(), content)) {
-    return fail("cannot write " + temp, errno);
-  }
-  if (fsync(out.Get()) != 0) {
-    return fail("cannot flush " + temp, errno);
-  }
-  if (!out.Close()) {
-    return fail("cannot close " + temp, errno);
-  }
-  if (rename(temp.c_str(), file.c_str()) != 0) {
-    return fail("cannot rename " + temp + " to " + file.string(), errno);
-  }
-  // The rename itself reaches the disk with the folder.
-  klibc::UniqueFd dir(open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (dir.Valid()) {
-    fsync(dir.Get());
-  }
-  return true;
+  error = what + ": " + ErrnoText(failure->error);
+  return false;
 }
 
 } // namespace zark::host
