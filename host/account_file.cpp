@@ -2,6 +2,9 @@
 
 #include "host_log.h"
 
+#include "klibc_fd.h"
+#include "klibc_replace.h"
+
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -15,28 +18,6 @@ namespace zark::host {
 namespace {
 
 constexpr std::size_t kMaxNameLength = 64;
-
-class FileDescriptor {
-public:
-  explicit FileDescriptor(int fd = -1) : mFd(fd) {}
-  ~FileDescriptor() { Close(); }
-  FileDescriptor(const FileDescriptor &) = delete;
-  FileDescriptor &operator=(const FileDescriptor &) = delete;
-  [[nodiscard]] int Get() const { return mFd; }
-  [[nodiscard]] bool Valid() const { return mFd >= 0; }
-  // Closes now; false when close reports an error (a lost write).
-  bool Close() {
-    if (mFd < 0) {
-      return true;
-    }
-    int fd = mFd;
-    mFd = -1;
-    return close(fd) == 0;
-  }
-
-private:
-  int mFd;
-};
 
 std::string ErrnoText(int error) {
   return std::strerror(error);
@@ -65,21 +46,6 @@ bool ReadAll(int fd, std::size_t limit, std::string &content, int &error) {
     }
     content.append(buffer, static_cast<std::size_t>(got));
   }
-}
-
-bool WriteAll(int fd, std::string_view data, int &error) {
-  while (!data.empty()) {
-    ssize_t put = write(fd, data.data(), data.size());
-    if (put < 0) {
-      if (errno == EINTR) {
-        continue;
-      }
-      error = errno;
-      return false;
-    }
-    data.remove_prefix(static_cast<std::size_t>(put));
-  }
-  return true;
 }
 
 std::vector<std::string_view> SplitLines(std::string_view content) {
@@ -153,7 +119,7 @@ bool IsValidAccountName(std::string_view name) {
 std::optional<std::vector<Account>>
 LoadAccounts(const std::filesystem::path &file) {
   // O_NONBLOCK: a FIFO put in the file's place must not hang a login.
-  FileDescriptor fd(
+  klibc::UniqueFd fd(
       open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
   if (!fd.Valid()) {
     int error = errno;
@@ -229,7 +195,7 @@ bool StoreAccount(const std::filesystem::path &file, const Account &account,
   // The old content, if any.
   std::string old;
   {
-    FileDescriptor in(
+    klibc::UniqueFd in(
         open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
     if (!in.Valid() && errno != ENOENT) {
       error = "cannot open " + file.string() + ": " + ErrnoText(errno);
@@ -281,45 +247,43 @@ bool StoreAccount(const std::filesystem::path &file, const Account &account,
     content += '\n';
   }
 
-  std::filesystem::path folder = file.parent_path();
-  if (folder.empty()) {
-    folder = ".";
+  klibc::ReplaceOptions options;
+  options.mode = 0600;
+  options.tempName = klibc::TempName::kBesidePath;
+  const std::optional<klibc::ReplaceFailure> failure =
+      klibc::ReplaceFile(file.string(), content, options);
+  // The rename reaches the disk with the folder; the new file is in place
+  // even when the folder cannot be flushed.
+  if (klibc::FileWasReplaced(failure)) {
+    return true;
   }
-  std::string temp = file.string() + ".XXXXXX";
-  FileDescriptor out(mkostemp(temp.data(), O_CLOEXEC));
-  if (!out.Valid()) {
-    error = "cannot create a temporary file beside " + file.string() + ": " +
-            ErrnoText(errno);
-    return false;
+  const std::string &temp = failure->tempPath;
+  std::string what;
+  switch (failure->step) {
+  case klibc::ReplaceStep::kCreateTemp:
+    what = "cannot create a temporary file beside " + file.string();
+    break;
+  case klibc::ReplaceStep::kSetMode:
+  case klibc::ReplaceStep::kSetOwner:
+    what = "cannot set mode 0600 on " + temp;
+    break;
+  case klibc::ReplaceStep::kWrite:
+    what = "cannot write " + temp;
+    break;
+  case klibc::ReplaceStep::kFlush:
+    what = "cannot flush " + temp;
+    break;
+  case klibc::ReplaceStep::kClose:
+    what = "cannot close " + temp;
+    break;
+  case klibc::ReplaceStep::kRename:
+  case klibc::ReplaceStep::kOpenFolder:
+  case klibc::ReplaceStep::kFlushFolder:
+    what = "cannot rename " + temp + " to " + file.string();
+    break;
   }
-  auto fail = [&](const std::string &what, int code) {
-    error = what + ": " + ErrnoText(code);
-    out.Close();
-    unlink(temp.c_str());
-    return false;
-  };
-  int writeError = 0;
-  if (fchmod(out.Get(), 0600) != 0) {
-    return fail("cannot set mode 0600 on " + temp, errno);
-  }
-  if (!WriteAll(out.Get(), content, writeError)) {
-    return fail("cannot write " + temp, writeError);
-  }
-  if (fsync(out.Get()) != 0) {
-    return fail("cannot flush " + temp, errno);
-  }
-  if (!out.Close()) {
-    return fail("cannot close " + temp, errno);
-  }
-  if (rename(temp.c_str(), file.c_str()) != 0) {
-    return fail("cannot rename " + temp + " to " + file.string(), errno);
-  }
-  // The rename itself reaches the disk with the folder.
-  FileDescriptor dir(open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (dir.Valid()) {
-    fsync(dir.Get());
-  }
-  return true;
+  error = what + ": " + ErrnoText(failure->error);
+  return false;
 }
 
 } // namespace zark::host

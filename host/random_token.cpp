@@ -2,47 +2,18 @@
 
 #include "host_log.h"
 
-#include <sys/random.h>
+#include "klibc_file.h"
 
-#include <array>
 #include <cerrno>
-#include <cstdint>
 #include <cstring>
 
 namespace zark::host {
-namespace {
-
-// getrandom returns at most what it was asked and may be interrupted; a few
-// tries are plenty for 16 bytes.
-constexpr int kMaxTries = 8;
-
-} // namespace
 
 std::optional<std::string> RandomHex128() {
-  std::array<unsigned char, 16> bytes{};
-  std::size_t filled = 0;
-  for (int tries = 0; tries < kMaxTries && filled < bytes.size(); ++tries) {
-    ssize_t got = getrandom(bytes.data() + filled, bytes.size() - filled, 0);
-    if (got < 0) {
-      int error = errno;
-      if (error == EINTR) {
-        continue;
-      }
-      HOST_LOG(LOG_ERR, "getrandom failed: %s", std::strerror(error));
-      return std::nullopt;
-    }
-    filled += static_cast<std::size_t>(got);
-  }
-  if (filled < bytes.size()) {
-    HOST_LOG(LOG_ERR, "getrandom gave %zu of %zu bytes", filled, bytes.size());
-    return std::nullopt;
-  }
-  static constexpr char kDigits[] = "0123456789abcdef";
-  std::string hex;
-  hex.reserve(bytes.size() * 2);
-  for (unsigned char byte : bytes) {
-    hex.push_back(kDigits[byte >> 4]);
-    hex.push_back(kDigits[byte & 0x0f]);
+  std::optional<std::string> hex = klibc::RandomHex(16);
+  if (!hex) {
+    const int error = errno;
+    HOST_LOG(LOG_ERR, "getrandom failed: %s", std::strerror(error));
   }
   return hex;
 }

@@ -3,6 +3,8 @@
 #include "account_file.h"
 #include "host_log.h"
 
+#include "klibc_text.h"
+
 #include <cctype>
 #include <cstdint>
 #include <exception>
@@ -17,16 +19,6 @@ constexpr std::string_view kFormType = "application/x-www-form-urlencoded";
 // never as JSON.
 constexpr const char *kAccountField = "account";
 constexpr const char *kPasswordField = "passwd";
-
-std::string_view Trim(std::string_view text) {
-  while (!text.empty() && (text.front() == ' ' || text.front() == '\t')) {
-    text.remove_prefix(1);
-  }
-  while (!text.empty() && (text.back() == ' ' || text.back() == '\t')) {
-    text.remove_suffix(1);
-  }
-  return text;
-}
 
 bool EqualsIgnoringCase(std::string_view a, std::string_view b) {
   if (a.size() != b.size()) {
@@ -44,7 +36,7 @@ bool EqualsIgnoringCase(std::string_view a, std::string_view b) {
 // "application/x-www-form-urlencoded; charset=UTF-8" is a form too.
 bool IsFormType(std::string_view contentType) {
   std::string_view media = contentType.substr(0, contentType.find(';'));
-  return EqualsIgnoringCase(Trim(media), kFormType);
+  return EqualsIgnoringCase(klibc::Trim(media, klibc::kSpaceAndTab), kFormType);
 }
 
 WebAnswer Answer(Json::Value body, int httpStatus = 200) {
@@ -99,13 +91,14 @@ bool QueryHasField(std::string_view query, std::string_view name) {
 std::string_view FindCookie(std::string_view cookies, std::string_view name) {
   while (!cookies.empty()) {
     std::size_t end = cookies.find(';');
-    std::string_view pair = Trim(cookies.substr(0, end));
+    std::string_view pair =
+        klibc::Trim(cookies.substr(0, end), klibc::kSpaceAndTab);
     cookies = end == std::string_view::npos ? std::string_view()
                                             : cookies.substr(end + 1);
     std::size_t equals = pair.find('=');
     if (equals != std::string_view::npos &&
-        Trim(pair.substr(0, equals)) == name) {
-      return Trim(pair.substr(equals + 1));
+        klibc::Trim(pair.substr(0, equals), klibc::kSpaceAndTab) == name) {
+      return klibc::Trim(pair.substr(equals + 1), klibc::kSpaceAndTab);
     }
   }
   return {};

@@ -69,7 +69,7 @@ expect "/usr/bin/zark-probed"
 extract="$out/extract"
 mkdir -p "$extract"
 dpkg-deb -x "$deb" "$extract"
-for elf in usr/sbin/zark-webapid usr/zark/bin/zarkportforward \
+for elf in usr/sbin/zark-webapid usr/bin/zark-probed usr/zark/bin/zarkportforward \
   "usr/$libdir/zark/modules/ZARK.Core.PortForwarding.so" \
   "usr/$libdir/zark/libzarkportmap.so"; do
   runpath=$(objdump -p "$extract/$elf" | awk '$1 == "RUNPATH" || $1 == "RPATH" { print $2 }')

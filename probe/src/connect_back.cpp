@@ -1,16 +1,18 @@
 #include "connect_back.h"
 
-#include "unique_fd.h"
+#include "klibc_fd.h"
+#include "klibc_file.h"
 
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <poll.h>
-#include <sys/random.h>
 
 #include <cerrno>
 #include <cstring>
 
 namespace zark::probe {
+
+using klibc::UniqueFd;
 namespace {
 
 using Clock = std::chrono::steady_clock;
@@ -52,26 +54,10 @@ const char *ConnectErrorReason(int error) {
   }
 }
 
+// 16 hexadecimal digits. Should the kernel give no randomness, the nonce is
+// all zeros rather than no nonce: the answer is then merely guessable.
 std::string RandomNonce() {
-  unsigned char bytes[8] = {};
-  std::size_t got = 0;
-  while (got < sizeof(bytes)) {
-    ssize_t n = ::getrandom(bytes + got, sizeof(bytes) - got, 0);
-    if (n < 0) {
-      if (errno == EINTR) {
-        continue;
-      }
-      break;
-    }
-    got += static_cast<std::size_t>(n);
-  }
-  static const char kHex[] = "0123456789abcdef";
-  std::string nonce;
-  for (unsigned char byte : bytes) {
-    nonce += kHex[byte >> 4];
-    nonce += kHex[byte & 0xf];
-  }
-  return nonce;
+  return klibc::RandomHex(8).value_or(std::string(16, '0'));
 }
 
 } // namespace

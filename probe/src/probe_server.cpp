@@ -277,7 +277,7 @@ void ProbeServer::Accept(int listenFd) {
   }
 }
 
-bool ProbeServer::WriteAll(int fd, std::string_view text) {
+bool ProbeServer::SendAll(int fd, std::string_view text) {
   const Clock::time_point deadline = Clock::now() + mOptions.writeTimeout;
   while (!text.empty()) {
     ssize_t sent = ::send(fd, text.data(), text.size(), MSG_NOSIGNAL);
@@ -315,7 +315,7 @@ void ProbeServer::Serve(UniqueFd fd, sockaddr_storage peer,
           std::lock_guard<std::mutex> lock(mMutex);
           ++mCounters.badRequests;
         }
-        (void)WriteAll(fd.Get(), FormatErrorAnswer(reason::kLineTooLong));
+        (void)SendAll(fd.Get(), FormatErrorAnswer(reason::kLineTooLong));
         return;
       }
       const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
@@ -364,7 +364,7 @@ void ProbeServer::Serve(UniqueFd fd, sockaddr_storage peer,
         std::lock_guard<std::mutex> lock(mMutex);
         ++mCounters.busy;
       }
-      (void)WriteAll(fd.Get(), FormatErrorAnswer(reason::kBusy));
+      (void)SendAll(fd.Get(), FormatErrorAnswer(reason::kBusy));
       return;
     }
     ParsedRequest parsed = ParseRequestLine(line);
@@ -373,7 +373,7 @@ void ProbeServer::Serve(UniqueFd fd, sockaddr_storage peer,
         std::lock_guard<std::mutex> lock(mMutex);
         ++mCounters.badRequests;
       }
-      (void)WriteAll(fd.Get(), FormatBadRequestAnswer(parsed.error));
+      (void)SendAll(fd.Get(), FormatBadRequestAnswer(parsed.error));
       return;
     }
     RateLimiter::Decision decision;
@@ -407,7 +407,7 @@ void ProbeServer::Serve(UniqueFd fd, sockaddr_storage peer,
           std::to_string(parsed.request.port) + ": " +
           ResultName(verdict.result) + " (" + verdict.reason + ")");
     }
-    if (!WriteAll(fd.Get(), answer)) {
+    if (!SendAll(fd.Get(), answer)) {
       return;
     }
   }

@@ -16,8 +16,8 @@
 #define ZARK_PROBE_PROBE_SERVER_H
 
 #include "connect_back.h"
+#include "klibc_fd.h"
 #include "rate_limiter.h"
-#include "unique_fd.h"
 
 #include <atomic>
 #include <chrono>
@@ -33,6 +33,8 @@
 #include <vector>
 
 namespace zark::probe {
+
+using klibc::UniqueFd;
 
 struct ServerOptions {
   // "a.b.c.d:port" or "[v6]:port"; port 0 picks a free port (see Ports()).
@@ -96,7 +98,10 @@ private:
   void Serve(UniqueFd fd, sockaddr_storage peer, socklen_t peerLength,
              const std::string &key);
   void ReapSessions(bool all);
-  [[nodiscard]] bool WriteAll(int fd, std::string_view text);
+  // Sends all of text on the socket fd, waiting while it is full, until
+  // mOptions.writeTimeout has passed. Unlike klibc::WriteAll it never raises
+  // SIGPIPE and gives up on a reader that stopped reading.
+  [[nodiscard]] bool SendAll(int fd, std::string_view text);
   void Log(const std::string &line) const;
   [[nodiscard]] std::chrono::steady_clock::time_point Now() const;
 

@@ -6,9 +6,12 @@
 
 #include <gtest/gtest.h>
 
+#include <arpa/inet.h>
+
 #include <fstream>
 #include <sstream>
 #include <string>
+#include <vector>
 
 namespace {
 
@@ -124,6 +127,24 @@ TEST(PortMapGatewayRoute, GetGatewayIPRefusesASmallBuffer) {
   char buf[16];
   EXPECT_EQ(-1, KLibGetGatewayIP(buf, 0));
   EXPECT_EQ(-1, KLibGetGatewayIP(buf, -5));
+}
+
+TEST(PortMapGatewayRoute, GatewayIsTheFirstOfTheDefaultRoutes) {
+  // One parser serves both: the gateway is the first route's, in network
+  // byte order, and the routes come lowest metric first.
+  std::string table =
+      kTitle + "wlan0\t00000000\t0100000A\t0003\t0\t0\t600\t00000000\t0\t0\t0\n"
+               "eth0\t00000000\t0101A8C0\t0003\t0\t0\t100\t00000000\t0\t0\t0\n"
+               "eth1\t0000A8C0\t00000000\t0001\t0\t0\t0\t0000FFFF\t0\t0\t0\n";
+  const std::vector<zark::portmap::DefaultRoute> routes =
+      zark::portmap::ParseDefaultRoutes(table);
+  ASSERT_EQ(routes.size(), 2U);
+  EXPECT_EQ(routes[0].interface, "eth0");
+  EXPECT_EQ(routes[0].gateway, 0xC0A80101U);
+  EXPECT_EQ(routes[0].metric, 100U);
+  EXPECT_EQ(routes[1].interface, "wlan0");
+  EXPECT_EQ(routes[1].gateway, 0x0A000001U);
+  EXPECT_EQ(ParseDefaultGateway(table), htonl(routes[0].gateway));
 }
 
 } // namespace

@@ -1,6 +1,6 @@
 #include "port_list.h"
 
-#include "trim.h"
+#include "klibc_text.h"
 
 #include <charconv>
 
@@ -57,14 +57,15 @@ bool CheckItem(std::string_view item, std::string &problem) {
 
 PortListParse ParsePortList(std::string_view text) {
   PortListParse result;
-  std::string_view rest = Trim(text);
+  std::string_view rest = klibc::Trim(text, klibc::kWhiteSpace);
   if (rest.empty()) {
     result.ok = true;
     return result;
   }
   while (true) {
     size_t comma = rest.find(',');
-    std::string_view item = Trim(rest.substr(0, comma));
+    std::string_view item =
+        klibc::Trim(rest.substr(0, comma), klibc::kWhiteSpace);
     if (item.empty()) {
       result.items.clear();
       result.problem = "empty port item";

@@ -1,7 +1,7 @@
 #include "service_file.h"
 
+#include "klibc_text.h"
 #include "port_list.h"
-#include "trim.h"
 #include "zarkfw.h"
 
 #include <algorithm>
@@ -44,7 +44,8 @@ std::vector<RawSection> SplitSections(std::string_view text,
   int lineNo = 0;
   while (!text.empty()) {
     size_t newline = text.find('\n');
-    std::string_view line = Trim(text.substr(0, newline));
+    std::string_view line =
+        klibc::Trim(text.substr(0, newline), klibc::kWhiteSpace);
     text = newline == std::string_view::npos ? std::string_view()
                                              : text.substr(newline + 1);
     ++lineNo;
@@ -61,13 +62,17 @@ std::vector<RawSection> SplitSections(std::string_view text,
         continue;
       }
       sections.push_back(
-          RawSection{std::string(Trim(line.substr(1, close - 1))), lineNo, {}});
+          RawSection{std::string(klibc::Trim(line.substr(1, close - 1),
+                                             klibc::kWhiteSpace)),
+                     lineNo,
+                     {}});
       continue;
     }
     size_t equals = line.find('=');
-    std::string_view key = equals == std::string_view::npos
-                               ? std::string_view()
-                               : Trim(line.substr(0, equals));
+    std::string_view key =
+        equals == std::string_view::npos
+            ? std::string_view()
+            : klibc::Trim(line.substr(0, equals), klibc::kWhiteSpace);
     if (key.empty()) {
       problems.push_back(LinePrefix(lineNo) +
                          "ignored: not a section header, key or comment");
@@ -80,7 +85,9 @@ std::vector<RawSection> SplitSections(std::string_view text,
     }
     sections.back().keys.push_back(
         KeyValue{std::string(key),
-                 std::string(Unquote(Trim(line.substr(equals + 1)))), lineNo});
+                 std::string(Unquote(
+                     klibc::Trim(line.substr(equals + 1), klibc::kWhiteSpace))),
+                 lineNo});
   }
   return sections;
 }

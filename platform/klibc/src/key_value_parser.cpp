@@ -1,21 +1,13 @@
 #include "key_value_parser.h"
 
+#include "klibc_text.h"
+
 #include <unordered_set>
 
 namespace zark::klibc {
 namespace {
 
-constexpr std::string_view kBlanks = " \t\r\f\v";
 constexpr std::string_view kByteOrderMark = "\xEF\xBB\xBF";
-
-std::string_view Trim(std::string_view text) {
-  const std::size_t first = text.find_first_not_of(kBlanks);
-  if (first == std::string_view::npos) {
-    return {};
-  }
-  const std::size_t last = text.find_last_not_of(kBlanks);
-  return text.substr(first, last - first + 1);
-}
 
 // A value written as "..." stands for exactly what lies between the quotes,
 // so that leading and trailing blanks (and "=", "#") can be kept.
@@ -46,25 +38,28 @@ KeyValueText ParseKeyValueText(std::string_view text) {
       --lineEnd;
     }
     const std::string_view line =
-        Trim(text.substr(lineStart, lineEnd - lineStart));
+        Trim(text.substr(lineStart, lineEnd - lineStart), kBlanksButLineFeed);
     if (line.empty() || line.front() == '#' || line.front() == ';') {
       // blank or comment
     } else if (line.front() == '[') {
       const std::size_t close = line.find(']');
       if (close != std::string_view::npos) {
-        currentSection = std::string(Trim(line.substr(1, close - 1)));
+        currentSection =
+            std::string(Trim(line.substr(1, close - 1), kBlanksButLineFeed));
         if (seenSections.insert(currentSection).second) {
           result.sections.push_back(currentSection);
         }
       }
     } else if (const std::size_t equals = line.find('=');
                equals != std::string_view::npos) {
-      const std::string_view key = Trim(line.substr(0, equals));
+      const std::string_view key =
+          Trim(line.substr(0, equals), kBlanksButLineFeed);
       if (!key.empty()) {
-        result.entries.push_back(
-            KeyValueEntry{currentSection, std::string(key),
-                          std::string(Unquote(Trim(line.substr(equals + 1)))),
-                          lineStart, lineEnd});
+        result.entries.push_back(KeyValueEntry{
+            currentSection, std::string(key),
+            std::string(
+                Unquote(Trim(line.substr(equals + 1), kBlanksButLineFeed))),
+            lineStart, lineEnd});
       }
     }
     lineStart = newline + 1;

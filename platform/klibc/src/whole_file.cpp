@@ -1,84 +1,15 @@
 #include "whole_file.h"
 
 #include "error_state.h"
+#include "klibc_fd.h"
+#include "klibc_replace.h"
 
 #include <fcntl.h>
 #include <unistd.h>
 
 #include <cerrno>
-#include <cstdio>
-#include <utility>
 
 namespace zark::klibc {
-namespace {
-
-class UniqueFd {
-public:
-  explicit UniqueFd(int fd) : mFd(fd) {}
-  ~UniqueFd() { (void)Close(); }
-  UniqueFd(const UniqueFd &) = delete;
-  UniqueFd &operator=(const UniqueFd &) = delete;
-
-  [[nodiscard]] int Get() const { return mFd; }
-  [[nodiscard]] bool Valid() const { return mFd >= 0; }
-  // Closes now and tells whether the close succeeded (it can report a
-  // delayed write error).
-  [[nodiscard]] bool Close() {
-    if (mFd < 0) {
-      return true;
-    }
-    const int fd = std::exchange(mFd, -1);
-    return close(fd) == 0;
-  }
-
-private:
-  int mFd;
-};
-
-// A temporary file, removed again unless the rename took it over. The
-// path is complete before the file is made, so that nothing can fail (or
-// throw) between making the file and owning it.
-class TempFile {
-public:
-  explicit TempFile(std::string pathTemplate)
-      : mPath(std::move(pathTemplate)) {}
-  ~TempFile() {
-    if (mCreated) {
-      unlink(mPath.c_str());
-    }
-  }
-  TempFile(const TempFile &) = delete;
-  TempFile &operator=(const TempFile &) = delete;
-
-  // Makes the file from the template ("...XXXXXX"); its descriptor, or -1.
-  [[nodiscard]] int Create() {
-    const int fd = mkostemp(mPath.data(), O_CLOEXEC);
-    mCreated = fd >= 0;
-    return fd;
-  }
-  [[nodiscard]] const std::string &Path() const { return mPath; }
-  void Release() { mCreated = false; }
-
-private:
-  std::string mPath;
-  bool mCreated = false;
-};
-
-[[nodiscard]] bool WriteAll(int fd, std::string_view content) {
-  while (!content.empty()) {
-    const ssize_t written = write(fd, content.data(), content.size());
-    if (written < 0) {
-      if (errno == EINTR) {
-        continue;
-      }
-      return false;
-    }
-    content.remove_prefix(static_cast<std::size_t>(written));
-  }
-  return true;
-}
-
-} // namespace
 
 ReadStatus ReadWholeFile(const char *path, std::string &content,
                          struct stat *info) {
@@ -135,55 +66,14 @@ ReadStatus ReadWholeFile(const char *path, std::string &content,
 
 bool ReplaceFileAtomically(const std::string &path, std::string_view content,
                            const struct stat *old) {
-  const std::size_t slash = path.rfind('/');
-  const std::string folder = slash == std::string::npos ? std::string(".")
-                             : slash == 0               ? std::string("/")
-                                                        : path.substr(0, slash);
-  const std::string name =
-      slash == std::string::npos ? path : path.substr(slash + 1);
-  TempFile temp(folder + (folder == "/" ? "." : "/.") + name + ".XXXXXX");
-  UniqueFd fd(temp.Create());
-  if (!fd.Valid()) {
+  ReplaceOptions options;
+  options.mode = old != nullptr ? (old->st_mode & 07777) : 0644;
+  options.owner = old;
+  // The new content is in place even when the folder cannot be flushed, so
+  // that is not a failure.
+  if (!FileWasReplaced(ReplaceFile(path, content, options))) {
     KLIBC_RECORD_ERROR(KLIBC_ERR_FILE_WRITE);
     return false;
-  }
-  const mode_t mode = old != nullptr ? (old->st_mode & 07777) : 0644;
-  if (fchmod(fd.Get(), mode) != 0) {
-    KLIBC_RECORD_ERROR(KLIBC_ERR_FILE_WRITE);
-    return false;
-  }
-  if (old != nullptr &&
-      (old->st_uid != geteuid() || old->st_gid != getegid())) {
-    // Only a privileged caller may keep another user's ownership; anyone
-    // else ends up owning the rewritten file, as with any rewrite.
-    if (fchown(fd.Get(), old->st_uid, old->st_gid) == 0 &&
-        fchmod(fd.Get(), mode) != 0) { // fchown clears set-id bits
-      KLIBC_RECORD_ERROR(KLIBC_ERR_FILE_WRITE);
-      return false;
-    }
-  }
-  if (!WriteAll(fd.Get(), content)) {
-    KLIBC_RECORD_ERROR(KLIBC_ERR_FILE_WRITE);
-    return false;
-  }
-  if (fsync(fd.Get()) != 0) {
-    KLIBC_RECORD_ERROR(KLIBC_ERR_FILE_WRITE);
-    return false;
-  }
-  if (!fd.Close()) {
-    KLIBC_RECORD_ERROR(KLIBC_ERR_FILE_WRITE);
-    return false;
-  }
-  if (rename(temp.Path().c_str(), path.c_str()) != 0) {
-    KLIBC_RECORD_ERROR(KLIBC_ERR_FILE_WRITE);
-    return false;
-  }
-  temp.Release();
-  // Make the rename itself durable. The new content is in place either way,
-  // so a folder that cannot be flushed is not a failure.
-  UniqueFd folderFd(open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (folderFd.Valid() && fsync(folderFd.Get()) != 0) {
-    // ignored, see above
   }
   return true;
 }

@@ -3,6 +3,7 @@
 #include "libzarkportmap.h"
 
 #include "base/portmap_log.h"
+#include "base/record_text.h"
 #include "catalog/router_db.h"
 #include "catalog/router_db_update.h"
 
@@ -10,16 +11,7 @@
 #include <cstring>
 #include <exception>
 
-namespace {
-
-void CopyText(char (&field)[ZARK_PORTMAP_TEXT_SIZE], const std::string &text) {
-  // The database reader keeps every name and version below 1024 bytes.
-  std::size_t length = std::min(text.size(), sizeof(field) - 1);
-  std::memcpy(field, text.data(), length);
-  field[length] = '\0';
-}
-
-} // namespace
+namespace {} // namespace
 
 extern "C" {
 

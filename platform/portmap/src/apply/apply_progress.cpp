@@ -3,6 +3,8 @@
 #include "base/portmap_log.h"
 #include "base/unique_fd.h"
 
+#include "klibc_replace.h"
+
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -14,45 +16,25 @@
 namespace zark::portmap {
 namespace {
 
-bool WriteAll(int fd, std::string_view data) {
-  while (!data.empty()) {
-    ssize_t written = ::write(fd, data.data(), data.size());
-    if (written < 0) {
-      if (errno == EINTR) {
-        continue;
-      }
-      return false;
-    }
-    data.remove_prefix(static_cast<std::size_t>(written));
-  }
-  return true;
-}
-
 // Replaces path by a new file holding text: a temporary file beside it,
 // renamed over it. Not flushed to disk: progress is worth nothing after a
 // crash. rename() replaces a symlink at path rather than following it.
 bool ReplaceProgressFile(const std::string &path, std::string_view text) {
-  std::string temp = path + ".XXXXXX";
-  UniqueFd fd(::mkostemp(temp.data(), O_CLOEXEC));
-  if (!fd.Valid()) {
-    ZARK_PM_LOG_CALL("mkostemp", -1, errno, temp.c_str());
-    return false;
+  klibc::ReplaceOptions options;
+  options.mode = 0644;
+  options.tempName = klibc::TempName::kBesidePath;
+  options.flush = false;
+  const std::optional<klibc::ReplaceFailure> failure =
+      klibc::ReplaceFile(path, text, options);
+  if (!failure) {
+    return true;
   }
-  bool ok = ::fchmod(fd.Get(), 0644) == 0 && WriteAll(fd.Get(), text);
-  int savedErrno = errno;
-  if (::close(fd.Release()) != 0 && ok) {
-    ok = false;
-    savedErrno = errno;
+  if (failure->step == klibc::ReplaceStep::kCreateTemp) {
+    ZARK_PM_LOG_CALL("mkostemp", -1, failure->error, failure->tempPath.c_str());
+  } else {
+    ZARK_PM_LOG_CALL("write progress", -1, failure->error, path.c_str());
   }
-  if (!ok || ::rename(temp.c_str(), path.c_str()) != 0) {
-    if (ok) {
-      savedErrno = errno;
-    }
-    ZARK_PM_LOG_CALL("write progress", -1, savedErrno, path.c_str());
-    ::unlink(temp.c_str());
-    return false;
-  }
-  return true;
+  return false;
 }
 
 } // namespace

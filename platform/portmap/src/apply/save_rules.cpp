@@ -4,6 +4,7 @@
 #include "apply/apply_progress.h"
 #include "base/local_network.h"
 #include "base/portmap_log.h"
+#include "base/record_text.h"
 #include "catalog/router_conf_store.h"
 #include "rules/rule_validation.h"
 
@@ -23,16 +24,6 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 using Key = std::pair<IpProtocol, uint16_t>;
-
-std::string_view Field(const char (&field)[ZARK_PORTMAP_TEXT_SIZE]) {
-  return std::string_view(field, strnlen(field, ZARK_PORTMAP_TEXT_SIZE));
-}
-
-void CopyText(char (&to)[ZARK_PORTMAP_TEXT_SIZE], std::string_view text) {
-  std::size_t length = std::min(text.size(), sizeof(to) - 1);
-  std::memcpy(to, text.data(), length);
-  to[length] = '\0';
-}
 
 std::string PortText(IpProtocol protocol, uint16_t port) {
   return std::string(ProtocolText(protocol)) + " " + std::to_string(port);

@@ -3,6 +3,8 @@
 #include "base/portmap_log.h"
 #include "base/unique_fd.h"
 
+#include "klibc_replace.h"
+
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -13,37 +15,6 @@
 
 namespace zark::portmap {
 namespace {
-
-bool WriteAll(int fd, std::string_view data) {
-  while (!data.empty()) {
-    ssize_t written = ::write(fd, data.data(), data.size());
-    if (written < 0) {
-      if (errno == EINTR) {
-        continue;
-      }
-      return false;
-    }
-    data.remove_prefix(static_cast<std::size_t>(written));
-  }
-  return true;
-}
-
-// Removes the temporary file unless it was renamed into place.
-class TempFileGuard {
-public:
-  explicit TempFileGuard(std::string path) : mPath(std::move(path)) {}
-  TempFileGuard(const TempFileGuard &) = delete;
-  TempFileGuard &operator=(const TempFileGuard &) = delete;
-  ~TempFileGuard() {
-    if (!mPath.empty()) {
-      ::unlink(mPath.c_str());
-    }
-  }
-  void Keep() { mPath.clear(); }
-
-private:
-  std::string mPath;
-};
 
 void SplitPath(const std::string &path, std::string &folder,
                std::string &name) {
@@ -156,46 +127,47 @@ bool ReplaceFileAtomically(const std::string &path, std::string_view content,
   if (!MakeFolders(folder, 0755)) {
     return false;
   }
-  std::string tempPath = folder + "/." + name + ".XXXXXX";
-  UniqueFd fd(::mkostemp(tempPath.data(), O_CLOEXEC));
-  if (!fd.Valid()) {
-    ZARK_PM_LOG_CALL("mkostemp", -1, errno, tempPath.c_str());
-    return false;
+  klibc::ReplaceOptions options;
+  options.mode = mode;
+  const std::optional<klibc::ReplaceFailure> failure =
+      klibc::ReplaceFile(path, content, options);
+  if (!failure) {
+    return true;
   }
-  TempFileGuard guard(tempPath);
-  // mkostemp gives 0600 less the umask; set the mode exactly.
-  if (::fchmod(fd.Get(), mode) != 0) {
-    ZARK_PM_LOG_CALL("fchmod", -1, errno, tempPath.c_str());
-    return false;
+  const char *call = "";
+  const std::string *subject = &failure->tempPath;
+  switch (failure->step) {
+  case klibc::ReplaceStep::kCreateTemp:
+    call = "mkostemp";
+    break;
+  case klibc::ReplaceStep::kSetMode:
+  case klibc::ReplaceStep::kSetOwner:
+    call = "fchmod";
+    break;
+  case klibc::ReplaceStep::kWrite:
+    call = "write";
+    break;
+  case klibc::ReplaceStep::kFlush:
+    call = "fsync";
+    break;
+  case klibc::ReplaceStep::kClose:
+    call = "close";
+    break;
+  case klibc::ReplaceStep::kRename:
+    call = "rename";
+    subject = &path;
+    break;
+  case klibc::ReplaceStep::kOpenFolder:
+    call = "open";
+    subject = &failure->folder;
+    break;
+  case klibc::ReplaceStep::kFlushFolder:
+    call = "fsync";
+    subject = &failure->folder;
+    break;
   }
-  if (!WriteAll(fd.Get(), content)) {
-    ZARK_PM_LOG_CALL("write", -1, errno, tempPath.c_str());
-    return false;
-  }
-  if (::fsync(fd.Get()) != 0) {
-    ZARK_PM_LOG_CALL("fsync", -1, errno, tempPath.c_str());
-    return false;
-  }
-  if (::close(fd.Release()) != 0) {
-    ZARK_PM_LOG_CALL("close", -1, errno, tempPath.c_str());
-    return false;
-  }
-  if (::rename(tempPath.c_str(), path.c_str()) != 0) {
-    ZARK_PM_LOG_CALL("rename", -1, errno, path.c_str());
-    return false;
-  }
-  guard.Keep();
-  // Make the rename itself durable.
-  UniqueFd dir(::open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (!dir.Valid()) {
-    ZARK_PM_LOG_CALL("open", -1, errno, folder.c_str());
-    return false;
-  }
-  if (::fsync(dir.Get()) != 0) {
-    ZARK_PM_LOG_CALL("fsync", -1, errno, folder.c_str());
-    return false;
-  }
-  return true;
+  ZARK_PM_LOG_CALL(call, -1, failure->error, subject->c_str());
+  return false;
 }
 
 } // namespace zark::portmap

@@ -8,6 +8,7 @@
 #include <arpa/inet.h>
 #include <net/route.h>
 
+#include <algorithm>
 #include <charconv>
 #include <cstring>
 #include <vector>
@@ -15,11 +16,9 @@
 namespace zark::portmap {
 namespace {
 
-// The routing table is a few lines per interface; this is far above it.
-constexpr std::size_t kMaxRouteTableBytes = 1024 * 1024;
-
 // Columns of /proc/net/route.
 enum Column : std::size_t {
+  kInterface = 0,
   kDestination = 1,
   kGateway = 2,
   kFlags = 3,
@@ -58,9 +57,8 @@ bool ParseNumber(std::string_view text, int base, T &out) {
 
 } // namespace
 
-std::optional<uint32_t> ParseDefaultGateway(std::string_view routeTable) {
-  std::optional<uint32_t> best;
-  unsigned long bestMetric = 0;
+std::vector<DefaultRoute> ParseDefaultRoutes(std::string_view routeTable) {
+  std::vector<DefaultRoute> routes;
   bool titleLine = true;
   while (!routeTable.empty()) {
     std::size_t newline = routeTable.find('\n');
@@ -92,14 +90,23 @@ std::optional<uint32_t> ParseDefaultGateway(std::string_view routeTable) {
         (flags & wanted) != wanted) {
       continue;
     }
-    if (!best || metric < bestMetric) {
-      // The kernel printed the raw value, so its bytes in memory are the
-      // address in network byte order.
-      best = gateway;
-      bestMetric = metric;
-    }
+    // The kernel prints the raw 32-bit value, whose bytes in memory are the
+    // address in network byte order.
+    routes.push_back({std::string(fields[kInterface]), ntohl(gateway), metric});
   }
-  return best;
+  std::stable_sort(routes.begin(), routes.end(),
+                   [](const DefaultRoute &a, const DefaultRoute &b) {
+                     return a.metric < b.metric;
+                   });
+  return routes;
+}
+
+std::optional<uint32_t> ParseDefaultGateway(std::string_view routeTable) {
+  const std::vector<DefaultRoute> routes = ParseDefaultRoutes(routeTable);
+  if (routes.empty()) {
+    return std::nullopt;
+  }
+  return htonl(routes.front().gateway);
 }
 
 std::string FormatIPv4(uint32_t networkOrder) {

@@ -5,22 +5,29 @@
 
 namespace zark::portmap {
 
+bool ParseStrictJsonOrThrow(std::string_view text, Json::Value &root,
+                            std::string &why, int depth) {
+  Json::CharReaderBuilder builder;
+  // RFC 8259 only: no comments, no trailing content, no duplicate keys, and
+  // a nesting limit so that hostile input cannot exhaust the stack.
+  Json::CharReaderBuilder::strictMode(&builder.settings_);
+  builder.settings_["stackLimit"] = depth;
+  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  std::string errors;
+  Json::Value parsed;
+  if (!reader->parse(text.data(), text.data() + text.size(), &parsed,
+                     &errors)) {
+    why = "not valid JSON: " + errors;
+    return false;
+  }
+  root = std::move(parsed);
+  return true;
+}
+
 bool ParseStrictJson(std::string_view text, Json::Value &root, std::string &why,
                      int depth) noexcept {
   try {
-    Json::CharReaderBuilder builder;
-    Json::CharReaderBuilder::strictMode(&builder.settings_);
-    builder.settings_["stackLimit"] = depth;
-    std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-    std::string errors;
-    Json::Value parsed;
-    if (!reader->parse(text.data(), text.data() + text.size(), &parsed,
-                       &errors)) {
-      why = "not valid JSON: " + errors;
-      return false;
-    }
-    root = std::move(parsed);
-    return true;
+    return ParseStrictJsonOrThrow(text, root, why, depth);
   } catch (const std::exception &e) {
     why = std::string("not valid JSON: ") + e.what();
     return false;

@@ -1,7 +1,8 @@
-// Reading and writing the small JSON files of the port tests (the UPnP
-// test's run file and report, the database of tested routers) the same
-// strict way: RFC 8259 only (no comments, no trailing commas, no duplicate
-// keys, nothing after the document), bounded nesting.
+// Reading and writing the library's JSON documents (the rule file, the
+// router configuration, the detection result, the mapping state, the probe
+// service's answers, the port tests' files) the same strict way: RFC 8259 only
+// (no comments, no trailing commas, no duplicate keys, nothing after the
+// document), bounded nesting.
 #ifndef ZARK_PORTMAP_STRICT_JSON_H
 #define ZARK_PORTMAP_STRICT_JSON_H
 
@@ -12,8 +13,16 @@
 
 namespace zark::portmap {
 
-// Parses text into root. False, with why set, for anything that is not one
-// strict JSON document nested at most depth deep. Never throws.
+// Parses text into root. False, with why set to "not valid JSON: " and the
+// reader's errors, for anything that is not one strict JSON document.
+// Throws what the reader throws: std::bad_alloc, and Json::Exception for a
+// document nested deeper than depth, for callers that report those apart.
+[[nodiscard]] bool ParseStrictJsonOrThrow(std::string_view text,
+                                          Json::Value &root, std::string &why,
+                                          int depth);
+
+// ParseStrictJsonOrThrow, with a thrown exception turned into false and why
+// "not valid JSON: " and its text. Never throws.
 [[nodiscard]] bool ParseStrictJson(std::string_view text, Json::Value &root,
                                    std::string &why, int depth = 16) noexcept;
 

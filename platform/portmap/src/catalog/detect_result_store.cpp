@@ -2,6 +2,7 @@
 
 #include "base/conf_file.h"
 #include "base/portmap_log.h"
+#include "base/strict_json.h"
 
 #include <json/json.h>
 
@@ -47,14 +48,8 @@ bool ParseDocument(std::string_view text, ZARK_ROUTER_DETECT_RESULT &out,
     why = "larger than " + std::to_string(kMaxDetectResultBytes) + " bytes";
     return false;
   }
-  Json::CharReaderBuilder builder;
-  Json::CharReaderBuilder::strictMode(&builder.settings_);
-  builder.settings_["stackLimit"] = 8;
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
   Json::Value root;
-  std::string errors;
-  if (!reader->parse(text.data(), text.data() + text.size(), &root, &errors)) {
-    why = "not valid JSON: " + errors;
+  if (!ParseStrictJsonOrThrow(text, root, why, 8)) {
     return false;
   }
   if (!root.isObject()) {

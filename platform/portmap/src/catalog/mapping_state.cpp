@@ -3,6 +3,7 @@
 #include "base/conf_file.h"
 #include "base/local_network.h"
 #include "base/portmap_log.h"
+#include "base/strict_json.h"
 
 #include <json/json.h>
 
@@ -131,14 +132,10 @@ bool ReadRouter(const Json::Value &value, RouterRecord &router,
 
 bool ParseMappingStateOrThrow(std::string_view text, MappingState &state,
                               std::string &why) {
-  Json::CharReaderBuilder builder;
-  Json::CharReaderBuilder::strictMode(&builder.settings_);
-  builder.settings_["stackLimit"] = 16;
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
   Json::Value root;
-  std::string errors;
-  if (!reader->parse(text.data(), text.data() + text.size(), &root, &errors)) {
-    return Fail(why, "not valid JSON: " + errors);
+  std::string parseWhy;
+  if (!ParseStrictJsonOrThrow(text, root, parseWhy, 16)) {
+    return Fail(why, parseWhy);
   }
   if (!root.isObject()) {
     return Fail(why, "not a JSON object");

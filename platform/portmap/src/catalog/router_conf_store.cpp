@@ -2,6 +2,7 @@
 
 #include "base/conf_file.h"
 #include "base/portmap_log.h"
+#include "base/strict_json.h"
 
 #include <arpa/inet.h>
 #include <json/json.h>
@@ -46,15 +47,8 @@ bool ParseDocument(std::string_view text, ZARK_ROUTER_CONF &conf,
     why = "larger than " + std::to_string(kMaxRouterConfBytes) + " bytes";
     return false;
   }
-  Json::CharReaderBuilder builder;
-  Json::CharReaderBuilder::strictMode(&builder.settings_);
-  builder.settings_["stackLimit"] = 16;
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
   Json::Value parsed;
-  std::string errors;
-  if (!reader->parse(text.data(), text.data() + text.size(), &parsed,
-                     &errors)) {
-    why = "not valid JSON: " + errors;
+  if (!ParseStrictJsonOrThrow(text, parsed, why, 16)) {
     return false;
   }
   const Json::Value &root = parsed;

@@ -4,6 +4,7 @@
 #include "base/library_config.h"
 #include "base/local_network.h"
 #include "base/portmap_log.h"
+#include "base/record_text.h"
 #include "base/strict_json.h"
 #include "catalog/router_conf_store.h"
 #include "compat/compatibility_report.h"
@@ -34,16 +35,6 @@ constexpr int kRunVersion = 1;
 constexpr int kListenerTries = 16;
 // Spare ports beyond the asked number, for ports found taken on the way.
 constexpr int kSparePorts = 32;
-
-std::string_view Field(const char (&field)[ZARK_PORTMAP_TEXT_SIZE]) {
-  return std::string_view(field, strnlen(field, ZARK_PORTMAP_TEXT_SIZE));
-}
-
-void CopyText(char (&to)[ZARK_PORTMAP_TEXT_SIZE], std::string_view text) {
-  std::size_t length = std::min(text.size(), sizeof(to) - 1);
-  std::memcpy(to, text.data(), length);
-  to[length] = '\0';
-}
 
 std::string TcpPort(uint16_t port) {
   return "tcp " + std::to_string(port);

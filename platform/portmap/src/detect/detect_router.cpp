@@ -5,6 +5,7 @@
 #include "base/ipv4_class.h"
 #include "base/library_config.h"
 #include "base/portmap_log.h"
+#include "base/record_text.h"
 #include "base/unique_fd.h"
 #include "catalog/detect_result_store.h"
 #include "catalog/router_conf_store.h"
@@ -31,14 +32,11 @@ constexpr std::size_t kMaxResolvConfBytes = 64 * 1024;
 std::mutex gFactoryMutex;
 std::function<DetectEnvironment()> gFactory;
 
-void CopyText(char (&field)[ZARK_PORTMAP_TEXT_SIZE], std::string_view text) {
+// CopyText into a field cleared first, so no byte of an earlier value stays.
+void CopyTextZeroFilled(char (&field)[ZARK_PORTMAP_TEXT_SIZE],
+                        std::string_view text) {
   std::memset(field, 0, sizeof(field));
-  const std::size_t length = std::min(text.size(), sizeof(field) - 1);
-  std::memcpy(field, text.data(), length);
-}
-
-std::string Field(const char (&field)[ZARK_PORTMAP_TEXT_SIZE]) {
-  return std::string(field, ::strnlen(field, ZARK_PORTMAP_TEXT_SIZE));
+  CopyText(field, text);
 }
 
 std::string NameOf(std::string_view brand, std::string_view model,
@@ -73,7 +71,7 @@ public:
         routeTable ? ParseDefaultRoutes(*routeTable)
                    : std::vector<DefaultRoute>{};
     InterfaceCheck interface = CheckInterface(routes, *interfaces);
-    CopyText(mRecord.network_interface, interface.interface);
+    CopyTextZeroFilled(mRecord.network_interface, interface.interface);
     if (!interface.ok) {
       return Stop("interface", interface.why);
     }
@@ -89,7 +87,7 @@ public:
       return Stop("gateway", gateway.why);
     }
     const std::string gatewayText = FormatIpv4(gateway.gateway);
-    CopyText(mRecord.gateway_ip, gatewayText);
+    CopyTextZeroFilled(mRecord.gateway_ip, gatewayText);
     if (gateway.warning) {
       mRecord.warning |= ZARK_DETECT_WARN_GATEWAY;
       ZARK_DETECT_WARNING("detection: the gateway setting looks wrong: %s",
@@ -161,12 +159,12 @@ public:
     RouterCheck router = CheckRouter(findings);
     mRecord.support_upnp = static_cast<int32_t>(router.upnp);
     mRecord.support_natpmp = static_cast<int32_t>(router.natpmp);
-    CopyText(mRecord.router_brand, router.name.brand);
-    CopyText(mRecord.router_model, router.name.model);
-    CopyText(mRecord.router_version, router.name.version);
-    CopyText(mRecord.upnp_pfpath, router.name.pfpath);
-    CopyText(mRecord.router_user_setting_name,
-             mEnv.userSettingName(gatewayText));
+    CopyTextZeroFilled(mRecord.router_brand, router.name.brand);
+    CopyTextZeroFilled(mRecord.router_model, router.name.model);
+    CopyTextZeroFilled(mRecord.router_version, router.name.version);
+    CopyTextZeroFilled(mRecord.upnp_pfpath, router.name.pfpath);
+    CopyTextZeroFilled(mRecord.router_user_setting_name,
+                       mEnv.userSettingName(gatewayText));
     mRecord.router_max_rule =
         router.name.pfpath.empty() ? 0 : mEnv.maxRules(router.name);
     if (router.doubleNat) {

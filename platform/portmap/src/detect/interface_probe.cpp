@@ -6,57 +6,13 @@
 #include <arpa/inet.h>
 #include <ifaddrs.h>
 #include <net/if.h>
-#include <net/route.h>
 #include <netinet/in.h>
 
 #include <algorithm>
 #include <cerrno>
-#include <charconv>
 
 namespace zark::portmap {
 namespace {
-
-constexpr const char *kRouteTable = "/proc/net/route";
-// The routing table is a few lines per interface; this is far above it.
-constexpr std::size_t kMaxRouteTableBytes = 1024 * 1024;
-
-// Columns of /proc/net/route.
-enum Column : std::size_t {
-  kInterface = 0,
-  kDestination = 1,
-  kGateway = 2,
-  kFlags = 3,
-  kMetric = 6,
-  kMask = 7,
-  kColumnsNeeded = 8,
-};
-
-std::vector<std::string_view> Fields(std::string_view line) {
-  std::vector<std::string_view> fields;
-  std::size_t pos = 0;
-  while (pos < line.size()) {
-    std::size_t start = line.find_first_not_of(" \t\r", pos);
-    if (start == std::string_view::npos) {
-      break;
-    }
-    std::size_t end = line.find_first_of(" \t\r", start);
-    if (end == std::string_view::npos) {
-      end = line.size();
-    }
-    fields.push_back(line.substr(start, end - start));
-    pos = end;
-  }
-  return fields;
-}
-
-template <typename T> bool Number(std::string_view text, int base, T &out) {
-  if (text.empty()) {
-    return false;
-  }
-  auto [end, ec] =
-      std::from_chars(text.data(), text.data() + text.size(), out, base);
-  return ec == std::errc() && end == text.data() + text.size();
-}
 
 const InterfaceInfo *FindInterface(const std::vector<InterfaceInfo> &interfaces,
                                    std::string_view name) {
@@ -86,9 +42,10 @@ std::string NetworkText(const Ipv4Network &network) {
 class SystemNetworkInfo final : public NetworkInfoSource {
 public:
   std::optional<std::string> RouteTable() override {
-    ReadResult read = ReadSmallFile(kRouteTable, kMaxRouteTableBytes);
+    ReadResult read = ReadSmallFile(kRouteTablePath, kMaxRouteTableBytes);
     if (read.status != ReadStatus::kRead) {
-      ZARK_PM_LOG_ERROR("cannot read %s: no routes to look at", kRouteTable);
+      ZARK_PM_LOG_ERROR("cannot read %s: no routes to look at",
+                        kRouteTablePath);
       return std::nullopt;
     }
     return std::move(read.content);
@@ -137,50 +94,6 @@ public:
 };
 
 } // namespace
-
-std::vector<DefaultRoute> ParseDefaultRoutes(std::string_view routeTable) {
-  std::vector<DefaultRoute> routes;
-  bool titleLine = true;
-  while (!routeTable.empty()) {
-    std::size_t newline = routeTable.find('\n');
-    std::string_view line = routeTable.substr(0, newline);
-    routeTable.remove_prefix(
-        newline == std::string_view::npos ? routeTable.size() : newline + 1);
-    if (titleLine) {
-      titleLine = false;
-      continue;
-    }
-    std::vector<std::string_view> fields = Fields(line);
-    if (fields.size() < kColumnsNeeded) {
-      continue;
-    }
-    uint32_t destination = 0;
-    uint32_t gateway = 0;
-    uint32_t mask = 0;
-    unsigned flags = 0;
-    unsigned long metric = 0;
-    if (!Number(fields[kDestination], 16, destination) ||
-        !Number(fields[kGateway], 16, gateway) ||
-        !Number(fields[kFlags], 16, flags) ||
-        !Number(fields[kMetric], 10, metric) ||
-        !Number(fields[kMask], 16, mask)) {
-      continue;
-    }
-    const unsigned wanted = RTF_UP | RTF_GATEWAY;
-    if (destination != 0 || mask != 0 || gateway == 0 ||
-        (flags & wanted) != wanted) {
-      continue;
-    }
-    // The kernel prints the raw 32-bit value, whose bytes in memory are the
-    // address in network byte order.
-    routes.push_back({std::string(fields[kInterface]), ntohl(gateway), metric});
-  }
-  std::stable_sort(routes.begin(), routes.end(),
-                   [](const DefaultRoute &a, const DefaultRoute &b) {
-                     return a.metric < b.metric;
-                   });
-  return routes;
-}
 
 std::unique_ptr<NetworkInfoSource> MakeSystemNetworkInfo() {
   return std::make_unique<SystemNetworkInfo>();

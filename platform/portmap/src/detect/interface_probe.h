@@ -7,6 +7,7 @@
 #define ZARK_PORTMAP_INTERFACE_PROBE_H
 
 #include "base/local_network.h"
+#include "base/route_table.h"
 
 #include <cstdint>
 #include <memory>
@@ -16,22 +17,6 @@
 #include <vector>
 
 namespace zark::portmap {
-
-// One default route of the kernel's IPv4 routing table.
-struct DefaultRoute {
-  std::string interface;
-  uint32_t gateway = 0; // host byte order
-  unsigned long metric = 0;
-  friend bool operator==(const DefaultRoute &, const DefaultRoute &) = default;
-};
-
-// Every default route in the text of /proc/net/route (destination 0, mask
-// 0, flags RTF_UP and RTF_GATEWAY, a gateway), lowest metric first, equal
-// metrics in the order listed: the first one is the route the kernel uses
-// and the gateway KLibGetGatewayIP answers. Lines that do not parse are
-// skipped. Pure.
-[[nodiscard]] std::vector<DefaultRoute>
-ParseDefaultRoutes(std::string_view routeTable);
 
 // One network interface as getifaddrs describes it.
 struct InterfaceInfo {

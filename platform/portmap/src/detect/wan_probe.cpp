@@ -4,6 +4,8 @@
 #include "base/portmap_log.h"
 #include "base/unique_fd.h"
 
+#include "klibc_text.h"
+
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <poll.h>
@@ -18,15 +20,6 @@ namespace zark::portmap {
 namespace {
 
 using Clock = std::chrono::steady_clock;
-
-std::string_view Trim(std::string_view text) {
-  const std::size_t start = text.find_first_not_of(" \t");
-  if (start == std::string_view::npos) {
-    return {};
-  }
-  const std::size_t end = text.find_last_not_of(" \t");
-  return text.substr(start, end - start + 1);
-}
 
 std::string ErrnoText(int error) {
   char buffer[128];
@@ -146,7 +139,8 @@ std::vector<WanProbeHost> ParseWanProbeHosts(std::string_view text) {
   std::vector<WanProbeHost> hosts;
   while (!text.empty()) {
     const std::size_t comma = text.find(',');
-    std::string_view item = Trim(text.substr(0, comma));
+    std::string_view item =
+        klibc::Trim(text.substr(0, comma), klibc::kSpaceAndTab);
     text.remove_prefix(comma == std::string_view::npos ? text.size()
                                                        : comma + 1);
     if (item.empty()) {

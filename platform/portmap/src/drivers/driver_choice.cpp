@@ -2,6 +2,7 @@
 
 #include "base/detect_log.h"
 #include "base/portmap_log.h"
+#include "base/record_text.h"
 #include "catalog/detect_result_store.h"
 #include "catalog/router_conf_store.h"
 #include "catalog/router_db.h"
@@ -21,10 +22,6 @@ std::optional<RouterOverrides> gOverrides;
 std::optional<RouterOverrides> Overrides() {
   std::lock_guard<std::mutex> lock(gOverridesMutex);
   return gOverrides;
-}
-
-std::string_view Field(const char (&field)[ZARK_PORTMAP_TEXT_SIZE]) {
-  return std::string_view(field, strnlen(field, ZARK_PORTMAP_TEXT_SIZE));
 }
 
 // The protocol a router database entry names, when the library drives it

@@ -2,6 +2,8 @@
 
 #include "base/portmap_log.h"
 
+#include "klibc_file.h"
+
 #include <httplib.h>
 #include <unistd.h>
 
@@ -13,21 +15,6 @@ namespace zark::portmap {
 namespace {
 
 using Clock = std::chrono::steady_clock;
-
-bool WriteAll(int fd, const char *data, std::size_t size) {
-  while (size > 0) {
-    ssize_t written = ::write(fd, data, size);
-    if (written < 0) {
-      if (errno == EINTR) {
-        continue;
-      }
-      return false;
-    }
-    data += written;
-    size -= static_cast<std::size_t>(written);
-  }
-  return true;
-}
 
 } // namespace
 
@@ -121,7 +108,7 @@ bool DownloadToFd(const std::string &url, int fd,
             tooSlow = true;
             return false;
           }
-          if (!WriteAll(fd, data, size)) {
+          if (!klibc::WriteAll(fd, std::string_view(data, size))) {
             writeErrno = errno;
             writeFailed = true;
             return false;

@@ -5,6 +5,8 @@
 #include "base/portmap_log.h"
 #include "base/unique_fd.h"
 
+#include "klibc_text.h"
+
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <poll.h>
@@ -21,15 +23,6 @@ using Clock = std::chrono::steady_clock;
 
 constexpr std::size_t kMaxLocation = 512;
 constexpr std::size_t kMaxDatagram = 2048;
-
-std::string_view Trim(std::string_view text) {
-  const std::size_t start = text.find_first_not_of(" \t\r");
-  if (start == std::string_view::npos) {
-    return {};
-  }
-  const std::size_t end = text.find_last_not_of(" \t\r");
-  return text.substr(start, end - start + 1);
-}
 
 bool SameTextIgnoringCase(std::string_view a, std::string_view b) {
   return a.size() == b.size() &&
@@ -75,7 +68,8 @@ std::string BuildMSearch(std::string_view searchTarget, int mxSeconds) {
 
 std::optional<SsdpReply> ParseSsdpReply(std::string_view datagram) {
   std::size_t newline = datagram.find('\n');
-  std::string_view status = Trim(datagram.substr(0, newline));
+  std::string_view status =
+      klibc::Trim(datagram.substr(0, newline), klibc::kSpaceTabAndCr);
   // "HTTP/1.1 200 OK" (some devices say HTTP/1.0).
   if (!status.starts_with("HTTP/1.") || status.size() < 12 ||
       (status.substr(8, 5) != " 200 " && status.substr(8) != " 200")) {
@@ -85,7 +79,8 @@ std::optional<SsdpReply> ParseSsdpReply(std::string_view datagram) {
   while (newline != std::string_view::npos) {
     datagram.remove_prefix(newline + 1);
     newline = datagram.find('\n');
-    std::string_view line = Trim(datagram.substr(0, newline));
+    std::string_view line =
+        klibc::Trim(datagram.substr(0, newline), klibc::kSpaceTabAndCr);
     if (line.empty()) {
       break; // the end of the headers
     }
@@ -93,8 +88,10 @@ std::optional<SsdpReply> ParseSsdpReply(std::string_view datagram) {
     if (colon == std::string_view::npos) {
       continue;
     }
-    std::string_view name = Trim(line.substr(0, colon));
-    std::string_view value = Trim(line.substr(colon + 1));
+    std::string_view name =
+        klibc::Trim(line.substr(0, colon), klibc::kSpaceTabAndCr);
+    std::string_view value =
+        klibc::Trim(line.substr(colon + 1), klibc::kSpaceTabAndCr);
     if (SameTextIgnoringCase(name, "LOCATION")) {
       reply.location = std::string(value);
     } else if (SameTextIgnoringCase(name, "ST")) {

@@ -2,6 +2,7 @@
 
 #include "base/library_config.h"
 #include "base/portmap_log.h"
+#include "base/strict_json.h"
 #include "base/unique_fd.h"
 
 #include <arpa/inet.h>
@@ -316,15 +317,10 @@ std::optional<ProbeAnswer> ParseProbeAnswer(std::string_view line) noexcept {
     if (line.size() > kMaxAnswerLine) {
       return std::nullopt;
     }
-    Json::CharReaderBuilder builder;
-    Json::CharReaderBuilder::strictMode(&builder.settings_);
-    builder.settings_["stackLimit"] = 4;
-    std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
     Json::Value root;
-    std::string errors;
-    if (!reader->parse(line.data(), line.data() + line.size(), &root,
-                       &errors) ||
-        !root.isObject() || !root["result"].isString()) {
+    std::string why;
+    if (!ParseStrictJsonOrThrow(line, root, why, 4) || !root.isObject() ||
+        !root["result"].isString()) {
       return std::nullopt;
     }
     auto text = [&](const char *key) -> std::optional<std::string> {

@@ -2,6 +2,7 @@
 
 #include "base/conf_file.h"
 #include "base/portmap_log.h"
+#include "base/record_text.h"
 #include "reach/token_listener.h"
 #include "rules/rule_validation.h"
 
@@ -19,10 +20,6 @@ namespace zark::portmap {
 namespace {
 
 using Clock = std::chrono::steady_clock;
-
-std::string_view Field(const char (&field)[ZARK_PORTMAP_TEXT_SIZE]) {
-  return std::string_view(field, strnlen(field, ZARK_PORTMAP_TEXT_SIZE));
-}
 
 std::string OneLine(std::string_view text) {
   std::string line(text);

@@ -2,10 +2,11 @@
 
 #include "base/portmap_log.h"
 
+#include "klibc_file.h"
+
 #include <netinet/in.h>
 #include <poll.h>
 #include <sys/eventfd.h>
-#include <sys/random.h>
 #include <sys/socket.h>
 
 #include <cerrno>
@@ -35,27 +36,13 @@ bool IsNonce(std::string_view text) {
 } // namespace
 
 std::string NewProbeToken() {
-  unsigned char bytes[16] = {};
-  std::size_t got = 0;
-  while (got < sizeof(bytes)) {
-    ssize_t n = ::getrandom(bytes + got, sizeof(bytes) - got, 0);
-    if (n < 0) {
-      if (errno == EINTR) {
-        continue;
-      }
-      int saved = errno;
-      ZARK_PM_LOG_CALL("getrandom", n, saved);
-      return {};
-    }
-    got += static_cast<std::size_t>(n);
+  std::optional<std::string> token = klibc::RandomHex(16);
+  if (!token) {
+    const int saved = errno;
+    ZARK_PM_LOG_CALL("getrandom", -1, saved);
+    return {};
   }
-  static const char kHex[] = "0123456789abcdef";
-  std::string token;
-  for (unsigned char byte : bytes) {
-    token += kHex[byte >> 4];
-    token += kHex[byte & 0xf];
-  }
-  return token;
+  return *token;
 }
 
 std::string UdpListenerAnswer(std::string_view token,

@@ -1,4 +1,5 @@
 #include "rules/rule_conf_format.h"
+#include "base/strict_json.h"
 
 #include <json/json.h>
 
@@ -74,17 +75,10 @@ ParsedRuleConf ParseDocument(std::string_view text) {
     return Refuse("larger than " + std::to_string(kMaxRuleConfBytes) +
                   " bytes");
   }
-  Json::CharReaderBuilder builder;
-  // Strict JSON: no comments, no trailing content, no duplicate keys, and a
-  // nesting limit so that hostile input cannot exhaust the stack.
-  Json::CharReaderBuilder::strictMode(&builder.settings_);
-  builder.settings_["stackLimit"] = 64;
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
   Json::Value parsedRoot;
-  std::string errors;
-  if (!reader->parse(text.data(), text.data() + text.size(), &parsedRoot,
-                     &errors)) {
-    return Refuse("not valid JSON: " + errors);
+  std::string why;
+  if (!ParseStrictJsonOrThrow(text, parsedRoot, why, 64)) {
+    return Refuse(why);
   }
   // Looked at through a const reference: operator[] then never adds members.
   const Json::Value &root = parsedRoot;

@@ -4,6 +4,7 @@
 
 #include "base/conf_file.h"
 #include "base/portmap_log.h"
+#include "base/record_text.h"
 #include "rules/rule_conf_format.h"
 #include "rules/rule_store_internal.h"
 
@@ -14,11 +15,6 @@
 
 namespace zark::portmap {
 namespace {
-
-void CopyField(char (&field)[ZARK_PORTMAP_TEXT_SIZE], const std::string &text) {
-  std::memcpy(field, text.data(), text.size());
-  field[text.size()] = '\0';
-}
 
 bool RuleFits(const RouterRule &rule) {
   return FitsRuleField(rule.ruleId) && FitsRuleField(rule.routerPort) &&
@@ -58,13 +54,13 @@ bool RulesToArray(std::span<const RouterRule> source, int *count,
   for (std::size_t i = 0; i < source.size(); ++i) {
     const RouterRule &rule = source[i];
     ZARK_ROUTER_RULE &record = array[i];
-    CopyField(record.rule_id, rule.ruleId);
+    CopyText(record.rule_id, rule.ruleId);
     record.enable = rule.enable ? 1 : 0;
-    CopyField(record.router_protocol, rule.protocol);
-    CopyField(record.router_port, rule.routerPort);
-    CopyField(record.ds_port, rule.dsPort);
-    CopyField(record.serviceid, rule.serviceId);
-    CopyField(record.service_name, rule.serviceName);
+    CopyText(record.router_protocol, rule.protocol);
+    CopyText(record.router_port, rule.routerPort);
+    CopyText(record.ds_port, rule.dsPort);
+    CopyText(record.serviceid, rule.serviceId);
+    CopyText(record.service_name, rule.serviceName);
   }
   *count = static_cast<int>(source.size());
   *rules = array;

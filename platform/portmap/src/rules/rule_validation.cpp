@@ -1,5 +1,8 @@
 #include "rules/rule_validation.h"
 
+#include "base/record_text.h"
+#include "klibc_text.h"
+
 #include <algorithm>
 #include <cctype>
 #include <cstring>
@@ -8,16 +11,6 @@
 
 namespace zark::portmap {
 namespace {
-
-std::string_view Trim(std::string_view text) {
-  while (!text.empty() && (text.front() == ' ' || text.front() == '\t')) {
-    text.remove_prefix(1);
-  }
-  while (!text.empty() && (text.back() == ' ' || text.back() == '\t')) {
-    text.remove_suffix(1);
-  }
-  return text;
-}
 
 std::string Lower(std::string_view text) {
   std::string lower(text);
@@ -50,11 +43,6 @@ PortTextError ParsePort(std::string_view text, long &port) {
   }
   port = value;
   return PortTextError::kNone;
-}
-
-// The text of a record field, which may lack its NUL.
-std::string_view Field(const char (&field)[ZARK_PORTMAP_TEXT_SIZE]) {
-  return std::string_view(field, strnlen(field, ZARK_PORTMAP_TEXT_SIZE));
 }
 
 RuleRefusal Refuse(uint32_t type, std::string reason) {
@@ -104,17 +92,20 @@ PortTextError ExpandPortText(std::string_view text,
   std::string_view rest = text;
   for (;;) {
     std::size_t comma = rest.find(',');
-    std::string_view item = Trim(rest.substr(0, comma));
+    std::string_view item =
+        klibc::Trim(rest.substr(0, comma), klibc::kSpaceAndTab);
     std::size_t dash = item.find('-');
     long first = 0;
     long last = 0;
-    PortTextError error = ParsePort(Trim(item.substr(0, dash)), first);
+    PortTextError error = ParsePort(
+        klibc::Trim(item.substr(0, dash), klibc::kSpaceAndTab), first);
     if (error != PortTextError::kNone) {
       return error;
     }
     last = first;
     if (dash != std::string_view::npos) {
-      std::string_view end = Trim(item.substr(dash + 1));
+      std::string_view end =
+          klibc::Trim(item.substr(dash + 1), klibc::kSpaceAndTab);
       // "a-" is the port a, as the module writes it.
       if (!end.empty()) {
         error = ParsePort(end, last);
@@ -140,7 +131,7 @@ PortTextError ExpandPortText(std::string_view text,
 }
 
 std::optional<std::vector<IpProtocol>> RuleProtocols(std::string_view text) {
-  std::string lower = Lower(Trim(text));
+  std::string lower = Lower(klibc::Trim(text, klibc::kSpaceAndTab));
   if (lower == "tcp") {
     return std::vector<IpProtocol>{IpProtocol::kTcp};
   }
@@ -158,7 +149,7 @@ std::optional<std::vector<IpProtocol>> RuleProtocols(std::string_view text) {
 }
 
 int MaxRouterEntries(std::string_view maxRuleText) {
-  std::string_view text = Trim(maxRuleText);
+  std::string_view text = klibc::Trim(maxRuleText, klibc::kSpaceAndTab);
   if (text.empty() || text.size() > 9) {
     return kDefaultMaxRouterEntries;
   }
@@ -200,10 +191,10 @@ RuleRefusal PlanWantedMappings(std::span<const ZARK_ROUTER_RULE> rules,
       refusal.text = std::string(protocolText);
       return refusal;
     }
-    if (Trim(routerText).empty()) {
+    if (klibc::Trim(routerText, klibc::kSpaceAndTab).empty()) {
       routerText = localText;
     }
-    if (Trim(localText).empty()) {
+    if (klibc::Trim(localText, klibc::kSpaceAndTab).empty()) {
       localText = routerText;
     }
     PortTextError error = ExpandPortText(routerText, routerPorts);

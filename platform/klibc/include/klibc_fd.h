@@ -1,12 +1,12 @@
-// An owned file descriptor, closed when its owner goes away.
-#ifndef ZARK_PROBE_UNIQUE_FD_H
-#define ZARK_PROBE_UNIQUE_FD_H
+// An owned file descriptor, closed when its owner goes away (C++ only).
+#ifndef ZARK_PLATFORM_KLIBC_FD_H
+#define ZARK_PLATFORM_KLIBC_FD_H
 
 #include <unistd.h>
 
 #include <utility>
 
-namespace zark::probe {
+namespace zark::klibc {
 
 class UniqueFd {
 public:
@@ -25,18 +25,28 @@ public:
 
   [[nodiscard]] int Get() const { return mFd; }
   [[nodiscard]] bool Valid() const { return mFd >= 0; }
+  // Gives up ownership: the descriptor, which the caller must close.
   [[nodiscard]] int Release() { return std::exchange(mFd, -1); }
+  // Closes the descriptor held (if any, ignoring the result) and owns fd.
   void Reset(int fd = -1) {
     if (mFd >= 0) {
       ::close(mFd);
     }
     mFd = fd;
   }
+  // Closes now and tells whether the close succeeded, since it can report a
+  // delayed write error (errno then says which). True when nothing was held.
+  [[nodiscard]] bool Close() {
+    if (mFd < 0) {
+      return true;
+    }
+    return ::close(std::exchange(mFd, -1)) == 0;
+  }
 
 private:
   int mFd = -1;
 };
 
-} // namespace zark::probe
+} // namespace zark::klibc
 
 #endif
