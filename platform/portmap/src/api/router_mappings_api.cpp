@@ -19,6 +19,19 @@ void SetErr(ZARK_LIBZARKPORTMAP_ERR *err, int32_t code) {
   }
 }
 
+// The fields a router's entry and our record of a mapping share.
+template <typename Mapping>
+ZARK_ROUTER_MAPPING &AddEntry(std::vector<ZARK_ROUTER_MAPPING> &entries,
+                              const Mapping &mapping) {
+  ZARK_ROUTER_MAPPING &entry = entries.emplace_back();
+  CopyText(entry.protocol, UpnpProtocolName(mapping.protocol));
+  entry.external_port = mapping.externalPort;
+  entry.internal_port = mapping.internalPort;
+  CopyText(entry.internal_client, mapping.internalClient);
+  entry.lease_seconds = mapping.leaseSeconds;
+  return entry;
+}
+
 // Hands the mappings to the caller as a malloc'ed array
 // (KLibFreeRouterMappings).
 bool HandOut(const std::vector<ZARK_ROUTER_MAPPING> &entries,
@@ -72,12 +85,7 @@ int ListMappings(const std::string &gateway, ZARK_ROUTER_MAPPINGS &out,
     CopyText(out.location, gateway);
     if (record != nullptr) {
       for (const RecordedMapping &mapping : record->mappings) {
-        ZARK_ROUTER_MAPPING &entry = entries.emplace_back();
-        CopyText(entry.protocol, UpnpProtocolName(mapping.protocol));
-        entry.external_port = mapping.externalPort;
-        entry.internal_port = mapping.internalPort;
-        CopyText(entry.internal_client, mapping.internalClient);
-        entry.lease_seconds = mapping.leaseSeconds;
+        ZARK_ROUTER_MAPPING &entry = AddEntry(entries, mapping);
         entry.ours = 1;
         entry.held = mapping.held ? 1 : 0;
         CopyText(entry.rule_id, mapping.ruleId);
@@ -90,12 +98,7 @@ int ListMappings(const std::string &gateway, ZARK_ROUTER_MAPPINGS &out,
   } else {
     CopyText(out.location, router->Location());
     for (const RouterMapping &mapping : listed) {
-      ZARK_ROUTER_MAPPING &entry = entries.emplace_back();
-      CopyText(entry.protocol, UpnpProtocolName(mapping.protocol));
-      entry.external_port = mapping.externalPort;
-      entry.internal_port = mapping.internalPort;
-      CopyText(entry.internal_client, mapping.internalClient);
-      entry.lease_seconds = mapping.leaseSeconds;
+      ZARK_ROUTER_MAPPING &entry = AddEntry(entries, mapping);
       CopyText(entry.description, mapping.description);
       const RecordedMapping *ours =
           record != nullptr
