@@ -5,7 +5,7 @@
 // (a quick probe of the router). The time of one detection in a fresh
 // network is printed first.
 //
-//   tests/netns/testnet.sh run ./bin/zark_bench_detect [--benchmark_...]
+//   testnet/testnet.sh run ./bin/zark_bench_detect [--benchmark_...]
 //   (as root; the benchmark enters its private mount namespace itself)
 #include "detect_support.h"
 #include "hermetic.h"
@@ -109,7 +109,7 @@ BENCHMARK(BM_ExternalAddressUnconfigured)
 int main(int argc, char **argv) {
   gNetwork = zark::testnet::CurrentNetwork();
   if (!gNetwork) {
-    std::fprintf(stderr, "run me through tests/netns/testnet.sh run\n");
+    std::fprintf(stderr, "run me through testnet/testnet.sh run\n");
     return 2;
   }
   std::string why;

@@ -6,7 +6,7 @@
 // router that drops unforwarded TCP would cost the probe's 3 s connect
 // timeout per check, eight checks at a time.)
 //
-//   tests/netns/testnet.sh run ./bin/zark_bench_porttest [--benchmark_...]
+//   testnet/testnet.sh run ./bin/zark_bench_porttest [--benchmark_...]
 //   (as root; the benchmark enters its private mount namespace itself)
 #include "hermetic.h"
 #include "klibc.h"
@@ -115,7 +115,7 @@ int main(int argc, char **argv) {
   std::optional<zark::testnet::TestNetwork> network =
       zark::testnet::CurrentNetwork();
   if (!network) {
-    std::fprintf(stderr, "run me through tests/netns/testnet.sh run\n");
+    std::fprintf(stderr, "run me through testnet/testnet.sh run\n");
     return 2;
   }
   std::string why;

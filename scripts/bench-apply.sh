@@ -1,7 +1,7 @@
 #!/usr/bin/env bash
 # The rule-apply benchmark of the port-map library against a real router:
 # builds bench/apply_rules_bench.cpp (RelWithDebInfo) and runs it in a test
-# network of its own (tests/netns/testnet.sh: outside host, router running
+# network of its own (testnet/testnet.sh: outside host, router running
 # miniupnpd, server), in the server namespace, where the benchmark enters
 # its private mount namespace. The network is brought down again on every
 # exit path: the benchmark ending or failing, Ctrl-C, SIGTERM, SIGHUP.
@@ -54,7 +54,7 @@ stop() {
 }
 trap stop INT TERM HUP
 
-bash "$root/tests/netns/testnet.sh" run \
+bash "$root/testnet/testnet.sh" run \
   /usr/bin/timeout --foreground --kill-after=10 "$limit" \
   "$build/bin/zark_bench_apply" "$@" &
 runner=$!

@@ -1,7 +1,8 @@
 # shellcheck shell=bash
-# The build folders of the test command (scripts/test.sh) and of the figures
-# command (scripts/figures.sh), configured the same way by both. Sourced,
-# not run; the caller sets root (the repository) and jobs.
+# The build folders of the test command (scripts/test.sh), the figures
+# command (scripts/figures.sh), the main job (scripts/run.sh) and the demo
+# (scripts/demo.sh), configured the same way by all. Sourced, not run; the
+# caller sets root (the repository) and jobs.
 #
 #   build        plain RelWithDebInfo build, install prefix /usr (the main
 #                job, the package and the end-to-end test use it)
@@ -32,11 +33,36 @@ build_folder() {
   cmake --build "$build" -j "$jobs"
 }
 
-build_plain() {
+# Configures folder BUILD as the plain build: installed as a system would be
+# (prefix /usr), so that the host's default folders and the libraries'
+# RPATH are the ones of the Debian package.
+configure_plain() {
   local reset
-  mapfile -t reset < <(forget_other_prefix "$root/build")
-  build_folder "$root/build" -DCMAKE_BUILD_TYPE=RelWithDebInfo \
-    -DCMAKE_INSTALL_PREFIX=/usr "${reset[@]}"
+  mapfile -t reset < <(forget_other_prefix "$1")
+  cmake -S "$root" -B "$1" -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+    -DCMAKE_INSTALL_PREFIX=/usr "${reset[@]}" >/dev/null
+}
+
+build_plain() {
+  configure_plain "$root/build"
+  cmake --build "$root/build" -j "$jobs"
+}
+
+# Builds in folder BUILD (plain) what the main job installs: every target
+# with an install rule.
+build_installed() {
+  configure_plain "$1"
+  cmake --build "$1" -j "$jobs" --target \
+    zark_klibc zark_webapi zark_portmap zark_firewall zark_module \
+    zarkportforward zark-webapid zark_probed
+}
+
+# Runs scripts/install-deps.sh with the given options once for the whole
+# run: the scripts called afterwards (scripts/tsan.sh, fuzz.sh, analyze.sh)
+# find ZARK_DEPS_INSTALLED and do not check again.
+install_deps_once() {
+  "$root/scripts/install-deps.sh" "$@"
+  export ZARK_DEPS_INSTALLED="base $*"
 }
 
 build_asan() {

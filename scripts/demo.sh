@@ -15,62 +15,34 @@
 # host and removes the network.
 set -euo pipefail
 
-tn_root=$(cd "$(dirname "$0")/.." && pwd)
-listen=${ZARK_LISTEN:-127.0.0.1:5000}
-tn_state=${ZARK_STATE_DIR:-$tn_root/state-demo}
-tn_build=${ZARK_BUILD_DIR:-$tn_root/build}
-
-while [ $# -gt 0 ]; do
-  case "$1" in
-  --listen)
-    [ $# -ge 2 ] || {
-      echo "demo.sh: --listen takes ADDRESS:PORT" >&2
-      exit 2
-    }
-    listen=$2
-    shift 2
-    ;;
-  --listen=*)
-    listen=${1#--listen=}
-    shift
-    ;;
-  -h | --help)
-    awk 'NR > 1 && /^#/ { sub(/^# ?/, ""); print; next } NR > 1 { exit }' "$0"
-    exit 0
-    ;;
-  *)
-    echo "demo.sh: unknown argument $1 (see --help)" >&2
-    exit 2
-    ;;
-  esac
-done
+root=$(cd "$(dirname "$0")/.." && pwd)
+# shellcheck source=scripts/main-job.sh
+. "$root/scripts/main-job.sh"
+parse_main_job_args demo.sh "$root/state-demo" "$@"
 
 if [ "$(id -u)" -ne 0 ]; then
   echo "demo.sh: run it as root: network and mount namespaces" >&2
   exit 1
 fi
-address=${listen%:*}
-port=${listen##*:}
-if ! [[ "$port" =~ ^[0-9]+$ ]] || [[ "$address" == *:* ]]; then
+if [[ "$address" == *:* ]]; then
   echo "demo.sh: --listen takes IPv4-ADDRESS:PORT, for example 127.0.0.1:5000" >&2
   exit 2
 fi
-if [ -n "$(ss -Hltn "sport = :$port" 2>/dev/null)" ]; then
+if port_in_use; then
   echo "demo.sh: something listens on port $port already; choose another: --listen 127.0.0.1:5001" >&2
   exit 1
 fi
 
-# Builds and installs into the state folder as the main job does, but does
-# not start the host there (ZARK_RUN_PREPARE_ONLY).
-ZARK_STATE_DIR="$tn_state" ZARK_BUILD_DIR="$tn_build" ZARK_RUN_PREPARE_ONLY=1 \
-  bash "$tn_root/scripts/run.sh"
-tn_state=$(realpath "$tn_state")
-tn_build=$(realpath "$tn_build")
+# Builds and installs into the state folder as the main job does; the host
+# is started inside the test network below.
+prepare_main_job
+tn_root=$root
+tn_state=$state
+tn_build=$build
 tn_logs="$tn_state/logs"
-password_file=$(bash "$tn_root/packaging/sandbox.sh" account "$tn_build" "$tn_state" admin)
 
-# shellcheck source-path=SCRIPTDIR/../tests/e2e disable=SC2154
-source "$tn_root/tests/e2e/testnet-host.sh"
+# shellcheck source-path=SCRIPTDIR/../testnet disable=SC2154
+source "$tn_root/testnet/testnet-host.sh"
 
 # shellcheck disable=SC2317 # called by the trap
 teardown() {
@@ -86,7 +58,7 @@ name="zd$$"
 echo "== test network $name"
 tn_up "$name"
 tn_start_dns
-probe="not built yet (probe/): the reachability test has no outside service"
+probe="none (no zark-probed in $tn_build/bin): the reachability test has no outside service"
 if tn_have_probe; then
   tn_start_probe
   tn_configure_probe

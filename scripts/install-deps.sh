@@ -13,6 +13,11 @@
 # nodejs is 18, too old for the locked build tools: where node is missing it
 # is installed from Debian all the same, and the version check below says
 # how to get a newer one.
+#
+# A caller that ran it already in this run exports ZARK_DEPS_INSTALLED with
+# the options it gave ("base --e2e --hardening"; scripts/builds.sh's
+# install_deps_once): when those include the ones asked for, nothing is
+# checked again.
 set -euo pipefail
 
 readonly NODE_MIN=20.19
@@ -42,6 +47,19 @@ for arg in "$@"; do
     ;;
   esac
 done
+
+if [ -n "${ZARK_DEPS_INSTALLED:-}" ]; then
+  covered=1
+  for arg in "$@"; do
+    case " $ZARK_DEPS_INSTALLED " in
+    *" $arg "*) ;;
+    *) covered=0 ;;
+    esac
+  done
+  if [ "$covered" = 1 ]; then
+    exit 0
+  fi
+fi
 
 missing=()
 for package in "${packages[@]}"; do

@@ -26,7 +26,7 @@ deps=(--e2e)
 if [ "$hardening" != 0 ]; then
   deps+=(--hardening)
 fi
-"$root/scripts/install-deps.sh" "${deps[@]}"
+install_deps_once "${deps[@]}"
 
 step() { echo "== $* ($(date +%T))"; }
 

@@ -7,7 +7,7 @@
 #
 # 1. installs BUILD and www/dist into a fresh state folder (packaging/
 #    sandbox.sh stage) with an account "admin" with a random password;
-# 2. brings up the test network (tests/netns/testnet.sh), starts the probe
+# 2. brings up the test network (testnet/testnet.sh), starts the probe
 #    service on the outside host when it is built, and names it in the
 #    library configuration;
 # 3. runs the host in the server namespace, in a private mount namespace,
@@ -46,7 +46,7 @@ artifacts=${ZARK_E2E_ARTIFACTS:-$tn_root/www/e2e-artifacts}
 time_limit=${ZARK_E2E_TIME_LIMIT:-900}
 
 # shellcheck source-path=SCRIPTDIR
-source "$tn_root/tests/e2e/testnet-host.sh"
+source "$tn_root/testnet/testnet-host.sh"
 
 fail() {
   echo "run-e2e: $*" >&2

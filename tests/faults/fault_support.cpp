@@ -230,7 +230,7 @@ void FaultTest::SetUp() {
   std::optional<zark::testnet::TestNetwork> network =
       zark::testnet::CurrentNetwork();
   ASSERT_TRUE(network.has_value())
-      << "run through tests/netns/run-in-testnet.sh (as CTest does)";
+      << "run through testnet/run-in-testnet.sh (as CTest does)";
   mNet = *network;
   ASSERT_FALSE(mNet.script.empty())
       << "testnet.sh did not say how to reach its router commands";

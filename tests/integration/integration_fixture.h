@@ -26,7 +26,7 @@ protected:
     std::optional<zark::testnet::TestNetwork> network =
         zark::testnet::CurrentNetwork();
     ASSERT_TRUE(network.has_value())
-        << "run through tests/netns/run-in-testnet.sh (as CTest does)";
+        << "run through testnet/run-in-testnet.sh (as CTest does)";
     mNet = *network;
     zark::test::ResetFixedPaths();
     zark::test::InstallShippedRouterDb();

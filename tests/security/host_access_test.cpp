@@ -139,7 +139,7 @@ protected:
     std::optional<zark::testnet::TestNetwork> network =
         zark::testnet::CurrentNetwork();
     ASSERT_TRUE(network.has_value())
-        << "run through tests/netns/run-in-testnet.sh (as CTest does)";
+        << "run through testnet/run-in-testnet.sh (as CTest does)";
     mGateway = network->lanRouter;
     zark::test::ResetFixedPaths();
     zark::test::InstallShippedRouterDb();
@@ -258,7 +258,7 @@ protected:
     std::optional<zark::testnet::TestNetwork> network =
         zark::testnet::CurrentNetwork();
     ASSERT_TRUE(network.has_value())
-        << "run through tests/netns/run-in-testnet.sh (as CTest does)";
+        << "run through testnet/run-in-testnet.sh (as CTest does)";
     zark::test::ResetFixedPaths();
     zark::test::InstallShippedRouterDb();
     zark::host::test::WriteStandardAccounts();

@@ -55,7 +55,7 @@ protected:
     std::optional<zark::testnet::TestNetwork> network =
         zark::testnet::CurrentNetwork();
     ASSERT_TRUE(network.has_value())
-        << "run through tests/netns/run-in-testnet.sh (as CTest does)";
+        << "run through testnet/run-in-testnet.sh (as CTest does)";
     mNet = *network;
     zark::test::ResetFixedPaths();
     zark::test::InstallShippedRouterDb();

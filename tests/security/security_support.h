@@ -5,7 +5,7 @@
 //
 // Everything runs inside the hermetic test process's private mount
 // namespace and, under CTest, in the server namespace of a test network of
-// its own (tests/netns/run-in-testnet.sh).
+// its own (testnet/run-in-testnet.sh).
 #ifndef ZARK_TESTS_SECURITY_SUPPORT_H
 #define ZARK_TESTS_SECURITY_SUPPORT_H
 

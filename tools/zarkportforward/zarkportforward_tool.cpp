@@ -1,12 +1,12 @@
 #include "zarkportforward_tool.h"
 
-#include "catalog/mapping_state.h"
-#include "drivers/driver_choice.h"
 #include "libzarkportmap.h"
+#include "zarkportforward.h"
 
 #include <getopt.h>
 
 #include <memory>
+#include <span>
 #include <vector>
 
 namespace zark::portmap {
@@ -31,17 +31,13 @@ private:
   bool mHeld;
 };
 
-struct RulesArrayDeleter {
-  void operator()(ZARK_ROUTER_RULE *rules) const { KLibFreeRulesArr(rules); }
-};
-
 int ExitForSaveError(uint32_t type) {
   switch (type) {
   case ZARK_SAVE_ERR_NONE:
     return kToolOk;
   case ZARK_SAVE_ERR_NOT_CONFIGURED:
     return kToolNotConfigured;
-  case kSaveErrIo:
+  case ZARK_PORTMAP_ERR_IO:
     return kToolFileFailed;
   case ZARK_SAVE_ERR_TOO_MANY_RULES:
   case ZARK_SAVE_ERR_BAD_PORT_TEXT:
@@ -56,29 +52,15 @@ int ExitForSaveError(uint32_t type) {
 }
 
 int Apply(const std::string &gateway, bool renew, std::ostream &out,
-          std::ostream &err, const ToolEnvironment &environment) {
-  int count = 0;
-  ZARK_ROUTER_RULE *raw = nullptr;
-  ZARK_LIBZARKPORTMAP_ERR readErr{};
-  if (KLibGetRulesArrFromRuleConf(&count, &raw, nullptr, false, &readErr) < 0) {
+          std::ostream &err) {
+  ZARK_PORTMAP_APPLY_SUMMARY summary{};
+  ZARK_ROUTER_SAVE_RULE_RESULT result{};
+  const int rc = KLibApplySavedRules(gateway.c_str(), renew, &summary, &result);
+  if (rc == ZARK_APPLY_SAVED_RULES_UNREADABLE) {
     err << "zarkportforward: cannot read the saved rules ("
         << ZARK_PORTMAP_RULE_CONF << ")\n";
     return kToolFileFailed;
   }
-  std::unique_ptr<ZARK_ROUTER_RULE, RulesArrayDeleter> rules(raw);
-
-  ApplyOptions options;
-  options.verifyUnchanged = true;
-  options.refreshLeases = true;
-  options.writeRuleConf = false;
-  options.reportProgress = !renew;
-  ZARK_ROUTER_SAVE_RULE_RESULT result{};
-  ApplySummary summary;
-  int rc = ApplyRules(gateway,
-                      std::span<const ZARK_ROUTER_RULE>(
-                          rules.get(), static_cast<std::size_t>(count)),
-                      options, environment.apply, result, nullptr, nullptr,
-                      &summary);
   out << (renew ? "renew" : "apply") << ": " << summary.deleted << " deleted, "
       << summary.added << " added, " << summary.checked << " checked, "
       << summary.unchanged << " unchanged, " << summary.failed << " failed\n";
@@ -100,60 +82,58 @@ int Apply(const std::string &gateway, bool renew, std::ostream &out,
   return ExitForSaveError(result.errType);
 }
 
-int List(const std::string &gateway, std::ostream &out, std::ostream &err,
-         const ToolEnvironment &environment) {
-  RouterChoice choice;
-  int code = ZARK_PORTMAP_ERR_NONE;
-  if (!environment.apply.chooseRouter(gateway, choice, code)) {
-    err << "zarkportforward: no router that the library can drive is "
-           "configured for "
-        << gateway << "\n";
-    return code == ZARK_PORTMAP_ERR_NOT_CONFIGURED ? kToolNotConfigured
-                                                   : kToolFileFailed;
-  }
-  MappingState state;
-  if (!LoadMappingState(environment.apply.statePath, state)) {
+// A list from KLibListRouterMappings, freed on every path.
+struct OwnedMappings {
+  OwnedMappings() = default;
+  OwnedMappings(const OwnedMappings &) = delete;
+  OwnedMappings &operator=(const OwnedMappings &) = delete;
+  ~OwnedMappings() { KLibFreeRouterMappings(&list); }
+  ZARK_ROUTER_MAPPINGS list{};
+};
+
+int List(const std::string &gateway, std::ostream &out, std::ostream &err) {
+  OwnedMappings owned;
+  ZARK_ROUTER_MAPPINGS &mappings = owned.list;
+  ZARK_LIBZARKPORTMAP_ERR listErr{};
+  const int rc = KLibListRouterMappings(gateway.c_str(), &mappings, &listErr);
+  if (mappings.record_unreadable != 0) {
     err << "zarkportforward: the record of our mappings cannot be read\n";
   }
-  const RouterRecord *record = state.Find(gateway, choice.protocol);
-  std::unique_ptr<RouterDriver> router =
-      environment.apply.makeRouter(choice.protocol, gateway, record);
-  if (router == nullptr) {
-    return kToolRouterFailed;
+  if (rc != 0) {
+    if (mappings.message[0] != '\0') {
+      err << "zarkportforward: " << mappings.message << "\n";
+    }
+    switch (listErr.err) {
+    case ZARK_PORTMAP_ERR_NOT_CONFIGURED:
+      return kToolNotConfigured;
+    case ZARK_PORTMAP_ERR_ROUTER:
+      return kToolRouterFailed;
+    default:
+      return kToolFileFailed;
+    }
   }
-  std::vector<RouterMapping> entries;
-  RouterResult listed = router->ListMappings(entries);
-  auto ours = [&](IpProtocol protocol, uint16_t port) {
-    return record != nullptr && record->Find(protocol, port) != nullptr;
-  };
-  if (listed.outcome == RouterOutcome::kUnsupported) {
-    out << "router: " << RouterProtocolName(choice.protocol) << " at "
-        << gateway
+  const std::span<const ZARK_ROUTER_MAPPING> entries(
+      mappings.mappings, static_cast<std::size_t>(mappings.count));
+  if (mappings.from_record != 0) {
+    out << "router: " << mappings.router_protocol << " at " << mappings.location
         << " (it cannot list its table; these are the mappings this server "
            "made)\n";
-    if (record != nullptr) {
-      for (const RecordedMapping &mapping : record->mappings) {
-        out << "* " << UpnpProtocolName(mapping.protocol) << " "
-            << mapping.externalPort << " -> " << mapping.internalClient << ":"
-            << mapping.internalPort << " lease " << mapping.leaseSeconds
-            << (mapping.held ? "" : " (not known to be held)") << " rule \""
-            << mapping.ruleId << "\"\n";
-      }
+    for (const ZARK_ROUTER_MAPPING &mapping : entries) {
+      out << "* " << mapping.protocol << " " << mapping.external_port << " -> "
+          << mapping.internal_client << ":" << mapping.internal_port
+          << " lease " << mapping.lease_seconds
+          << (mapping.held != 0 ? "" : " (not known to be held)") << " rule \""
+          << mapping.rule_id << "\"\n";
     }
     return kToolOk;
   }
-  if (!listed.Ok()) {
-    err << "zarkportforward: " << listed.message << "\n";
-    return kToolRouterFailed;
-  }
-  out << "router: " << RouterProtocolName(choice.protocol) << " at "
-      << router->Location() << "\n";
-  for (const RouterMapping &entry : entries) {
-    out << (ours(entry.protocol, entry.externalPort) ? "* " : "  ")
-        << UpnpProtocolName(entry.protocol) << " " << entry.externalPort
-        << " -> " << entry.internalClient << ":" << entry.internalPort
-        << " lease " << entry.leaseSeconds << " \"" << entry.description
-        << "\"\n";
+  out << "router: " << mappings.router_protocol << " at " << mappings.location
+      << "\n";
+  for (const ZARK_ROUTER_MAPPING &entry : entries) {
+    out << (entry.ours != 0 ? "* " : "  ") << entry.protocol << " "
+        << entry.external_port << " -> " << entry.internal_client << ":"
+        << entry.internal_port << " lease " << entry.lease_seconds << " \""
+        << entry.description << "\"\n";
   }
   out << entries.size() << " mapping(s); * made by this server\n";
   return kToolOk;
@@ -197,7 +177,6 @@ ToolEnvironment DefaultToolEnvironment() {
     }
     return std::string(buffer);
   };
-  environment.apply = DefaultApplyEnvironment();
   return environment;
 }
 
@@ -258,9 +237,9 @@ int RunZarkPortForward(std::span<const std::string> args, std::ostream &out,
     return kToolNoGateway;
   }
   if (command == "list") {
-    return List(*gateway, out, err, environment);
+    return List(*gateway, out, err);
   }
-  return Apply(*gateway, command == "renew", out, err, environment);
+  return Apply(*gateway, command == "renew", out, err);
 }
 
 } // namespace zark::portmap

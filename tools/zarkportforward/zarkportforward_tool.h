@@ -3,8 +3,6 @@
 #ifndef ZARK_TOOLS_ZARKPORTFORWARD_TOOL_H
 #define ZARK_TOOLS_ZARKPORTFORWARD_TOOL_H
 
-#include "apply/save_rules.h"
-
 #include <functional>
 #include <optional>
 #include <ostream>
@@ -31,7 +29,6 @@ enum ToolExit : int {
 struct ToolEnvironment {
   // The default gateway, nothing when unknown (KLibGetGatewayIP).
   std::function<std::optional<std::string>()> gateway;
-  ApplyEnvironment apply;
 };
 
 [[nodiscard]] ToolEnvironment DefaultToolEnvironment();

@@ -115,7 +115,7 @@ function step(name, detail = {}) {
 }
 
 // Texts of the visible message areas of a screen, so that failures the page
-// shows (for example parts of the host not built yet) are reported too.
+// shows (an error answer of the host, for example) are reported too.
 async function notices(page, scope) {
   return page.$$eval(`${scope} .notice:not([hidden])`, (els) => els.map((e) => e.textContent.trim()));
 }

@@ -72,7 +72,7 @@ tn_stop_group() {
 
 tn_up() {
   tn_name=$1
-  bash "$tn_root/tests/netns/testnet.sh" up "$tn_name"
+  bash "$tn_root/testnet/testnet.sh" up "$tn_name"
 }
 
 tn_server_ns() { echo "$tn_name-s"; }
@@ -187,7 +187,7 @@ tn_down() {
   tn_dns_pid=""
 tn_dns_pid=""
   if [ -n "$tn_name" ]; then
-    bash "$tn_root/tests/netns/testnet.sh" down "$tn_name" || true
+    bash "$tn_root/testnet/testnet.sh" down "$tn_name" || true
     tn_name=""
   fi
 }
