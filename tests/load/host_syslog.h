@@ -6,7 +6,7 @@
 #ifndef ZARK_TESTS_LOAD_HOST_SYSLOG_H
 #define ZARK_TESTS_LOAD_HOST_SYSLOG_H
 
-#include "base/unique_fd.h"
+#include "klibc_fd.h"
 
 #include <cstddef>
 #include <deque>
@@ -45,9 +45,9 @@ public:
 private:
   void Read();
 
-  zark::portmap::UniqueFd mSocket;
-  zark::portmap::UniqueFd mStopRead;
-  zark::portmap::UniqueFd mStopWrite;
+  zark::klibc::UniqueFd mSocket;
+  zark::klibc::UniqueFd mStopRead;
+  zark::klibc::UniqueFd mStopWrite;
   mutable std::mutex mMutex;
   std::deque<std::string> mLines;
   std::thread mReader;
