@@ -21,7 +21,9 @@ extern "C" int KLibApplySavedRules(const char *gatewayIP, bool renew,
                                    ZARK_ROUTER_SAVE_RULE_RESULT *result) {
   using namespace zark::portmap;
   ZARK_ROUTER_SAVE_RULE_RESULT local{};
-  ZARK_ROUTER_SAVE_RULE_RESULT &out = result != nullptr ? *result : local;
+  ZARK_ROUTER_SAVE_RULE_RESULT *const target =
+      result != nullptr ? result : &local;
+  ZARK_ROUTER_SAVE_RULE_RESULT &out = *target;
   out = ZARK_ROUTER_SAVE_RULE_RESULT{};
   if (summary != nullptr) {
     *summary = ZARK_PORTMAP_APPLY_SUMMARY{};

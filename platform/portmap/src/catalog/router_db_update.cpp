@@ -255,8 +255,7 @@ bool SwapIn(const std::string &staged, int &err) {
 
 // The configured update source; empty (logged, err set) when there is none.
 std::string UpdateSource(int &err) {
-  const std::string source =
-      GetLibraryConfig(config_key::kRouterDbUpdateSource, "");
+  std::string source = GetLibraryConfig(config_key::kRouterDbUpdateSource, "");
   if (source.empty()) {
     ZARK_PM_LOG_ERROR("no router database update source: set %s in %s",
                       std::string(config_key::kRouterDbUpdateSource).c_str(),

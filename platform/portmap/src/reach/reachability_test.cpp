@@ -542,7 +542,8 @@ int RunPortTest(std::span<const ZARK_ROUTER_RULE> rules,
                 const PortTestEnvironment &environment,
                 PortTestSummary *summary) {
   PortTestSummary local;
-  PortTestSummary &counts = summary != nullptr ? *summary : local;
+  PortTestSummary *const target = summary != nullptr ? summary : &local;
+  PortTestSummary &counts = *target;
   counts = PortTestSummary{};
   std::vector<RuleChecks> plans = PlanEnabledRules(rules);
   counts.rules = static_cast<int>(plans.size());
