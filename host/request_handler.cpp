@@ -20,23 +20,11 @@ constexpr std::string_view kFormType = "application/x-www-form-urlencoded";
 constexpr const char *kAccountField = "account";
 constexpr const char *kPasswordField = "passwd";
 
-bool EqualsIgnoringCase(std::string_view a, std::string_view b) {
-  if (a.size() != b.size()) {
-    return false;
-  }
-  for (std::size_t i = 0; i < a.size(); ++i) {
-    if (std::tolower(static_cast<unsigned char>(a[i])) !=
-        std::tolower(static_cast<unsigned char>(b[i]))) {
-      return false;
-    }
-  }
-  return true;
-}
-
 // "application/x-www-form-urlencoded; charset=UTF-8" is a form too.
 bool IsFormType(std::string_view contentType) {
   std::string_view media = contentType.substr(0, contentType.find(';'));
-  return EqualsIgnoringCase(klibc::Trim(media, klibc::kSpaceAndTab), kFormType);
+  return klibc::EqualsIgnoringCase(klibc::Trim(media, klibc::kSpaceAndTab),
+                                   kFormType);
 }
 
 WebAnswer Answer(Json::Value body, int httpStatus = 200) {

@@ -9,6 +9,16 @@
 #   build-asan   Debug build under AddressSanitizer (with LeakSanitizer) and
 #                UndefinedBehaviorSanitizer
 
+# New build folders use Ninja, once installed: it schedules the whole
+# tree's compiles across targets and starts faster than make. Folders
+# configured before keep their generator.
+use_ninja() {
+  if [ -z "${CMAKE_GENERATOR:-}" ] && command -v ninja >/dev/null; then
+    export CMAKE_GENERATOR=Ninja
+  fi
+}
+use_ninja
+
 # Options of the sanitizer runs: a leak, an address error or undefined
 # behaviour ends the test process with an error.
 export ASAN_OPTIONS=${ASAN_OPTIONS:-detect_leaks=1:abort_on_error=1}
@@ -63,6 +73,7 @@ build_installed() {
 install_deps_once() {
   "$root/scripts/install-deps.sh" "$@"
   export ZARK_DEPS_INSTALLED="base $*"
+  use_ninja
 }
 
 build_asan() {

@@ -23,7 +23,7 @@ set -euo pipefail
 readonly NODE_MIN=20.19
 
 packages=(
-  build-essential cmake pkg-config git
+  build-essential cmake ninja-build pkg-config git
   libjsoncpp-dev
   googletest libgtest-dev libgmock-dev libbenchmark-dev
   clang-format

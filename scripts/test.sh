@@ -2,7 +2,8 @@
 # Builds everything and runs every test: once in a plain build, once under
 # AddressSanitizer, LeakSanitizer and UndefinedBehaviorSanitizer; the host
 # framework and the host under ThreadSanitizer; a bounded libFuzzer run of
-# every fuzz target; clang-tidy and cppcheck; then the browser front end's
+# every fuzz target; clang-tidy and cppcheck (beside all of these, at the
+# lowest priority); then the browser front end's
 # build and unit tests, the Debian package's contents, and the end-to-end
 # browser test against the installed host in the test network with a real
 # router. Installs what is missing first. Needs root (private mount and
@@ -30,6 +31,25 @@ install_deps_once "${deps[@]}"
 
 step() { echo "== $* ($(date +%T))"; }
 
+# Static analysis needs no build of its own: it runs beside the builds and
+# tests at the lowest priority, soaking up the processors while tests wait
+# on the network, and its result is read at the end.
+analysis_pid=
+analysis_log=$root/build-tidy/analysis.log
+stop_analysis() {
+  if [ -n "$analysis_pid" ]; then
+    kill -- "-$analysis_pid" 2>/dev/null || kill "$analysis_pid" 2>/dev/null ||
+      true
+  fi
+}
+trap stop_analysis EXIT
+if [ "$hardening" != 0 ]; then
+  mkdir -p "$root/build-tidy"
+  step "static analysis started in the background (log: $analysis_log)"
+  setsid nice -n 19 bash "$root/scripts/analyze.sh" >"$analysis_log" 2>&1 &
+  analysis_pid=$!
+fi
+
 step "plain build"
 # Prefix /usr as the main job and the package: the end-to-end test installs
 # this build.
@@ -46,9 +66,6 @@ if [ "$hardening" != 0 ]; then
 
   step "bounded fuzzing run"
   FUZZ_SECONDS=${ZARK_FUZZ_SECONDS:-10} bash "$root/scripts/fuzz.sh"
-
-  step "static analysis"
-  bash "$root/scripts/analyze.sh"
 fi
 
 step "browser front end: build and unit tests"
@@ -60,5 +77,16 @@ bash "$root/packaging/check-deb.sh" "$root/build"
 if [ "${ZARK_E2E:-1}" != 0 ]; then
   step "end-to-end browser test (test network, real router)"
   bash "$root/tests/e2e/run-e2e.sh" "$root/build"
+fi
+if [ -n "$analysis_pid" ]; then
+  step "static analysis: waiting for its result"
+  analysis_status=0
+  wait "$analysis_pid" || analysis_status=$?
+  analysis_pid=
+  cat "$analysis_log"
+  if [ "$analysis_status" != 0 ]; then
+    echo "!!! static analysis failed (status $analysis_status)"
+    exit 1
+  fi
 fi
 step "all tests passed"

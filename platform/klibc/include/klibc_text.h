@@ -3,6 +3,7 @@
 #ifndef ZARK_PLATFORM_KLIBC_TEXT_H
 #define ZARK_PLATFORM_KLIBC_TEXT_H
 
+#include <cstddef>
 #include <string_view>
 
 namespace zark::klibc {
@@ -29,6 +30,29 @@ inline constexpr std::string_view kWhiteSpace = " \t\r\n\v\f";
   }
   const std::size_t last = text.find_last_not_of(blanks);
   return text.substr(first, last - first + 1);
+}
+
+// True when a and b hold the same text but for the case of ASCII letters
+// (protocol tokens: HTTP header names, SSDP search targets).
+[[nodiscard]] constexpr bool EqualsIgnoringCase(std::string_view a,
+                                                std::string_view b) {
+  if (a.size() != b.size()) {
+    return false;
+  }
+  for (std::size_t i = 0; i < a.size(); ++i) {
+    char x = a[i];
+    char y = b[i];
+    if (x >= 'A' && x <= 'Z') {
+      x = static_cast<char>(x - 'A' + 'a');
+    }
+    if (y >= 'A' && y <= 'Z') {
+      y = static_cast<char>(y - 'A' + 'a');
+    }
+    if (x != y) {
+      return false;
+    }
+  }
+  return true;
 }
 
 } // namespace zark::klibc

@@ -60,6 +60,22 @@ constexpr std::string_view kBlanks = " \t\r\f\v";
   return path;
 }
 
+// Reads the whole of a file that must exist. False when it does not (the
+// error recorded as KLIBC_ERR_FILE_NOT_FOUND) or cannot be read (recorded
+// by ReadWholeFile).
+bool ReadExistingFile(const char *file, std::string &content) {
+  switch (ReadWholeFile(file, content)) {
+  case ReadStatus::kRead:
+    return true;
+  case ReadStatus::kMissing:
+    KLIBC_RECORD_ERROR(KLIBC_ERR_FILE_NOT_FOUND);
+    return false;
+  case ReadStatus::kFailed:
+    return false;
+  }
+  return false;
+}
+
 int GetKeyValue(const char *file, const char *key, char *buf, int size,
                 int flags) {
   if (buf != nullptr && size > 0) {
@@ -71,13 +87,7 @@ int GetKeyValue(const char *file, const char *key, char *buf, int size,
     return -1;
   }
   std::string content;
-  switch (ReadWholeFile(file, content)) {
-  case ReadStatus::kRead:
-    break;
-  case ReadStatus::kMissing:
-    KLIBC_RECORD_ERROR(KLIBC_ERR_FILE_NOT_FOUND);
-    return -1;
-  case ReadStatus::kFailed:
+  if (!ReadExistingFile(file, content)) {
     return -1;
   }
   const KeyValueText parsed = ParseKeyValueText(content);
@@ -153,13 +163,7 @@ int EnumSection(const char *file, KLIBSZLIST **list) {
     return -1;
   }
   std::string content;
-  switch (ReadWholeFile(file, content)) {
-  case ReadStatus::kRead:
-    break;
-  case ReadStatus::kMissing:
-    KLIBC_RECORD_ERROR(KLIBC_ERR_FILE_NOT_FOUND);
-    return -1;
-  case ReadStatus::kFailed:
+  if (!ReadExistingFile(file, content)) {
     return -1;
   }
   const KeyValueText parsed = ParseKeyValueText(content);

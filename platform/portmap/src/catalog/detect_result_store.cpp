@@ -112,14 +112,7 @@ std::string SerializeDetectResult(const ZARK_ROUTER_DETECT_RESULT &result) {
     root[key] =
         Json::Value(field, field + ::strnlen(field, ZARK_PORTMAP_TEXT_SIZE));
   }
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = "  ";
-  // Bytes of 0x80 and above (names in the router's own language) are kept
-  // as they are.
-  builder["emitUTF8"] = true;
-  std::string text = Json::writeString(builder, root);
-  text.push_back('\n');
-  return text;
+  return WriteJsonText(root);
 }
 
 bool ParseDetectResult(std::string_view text, ZARK_ROUTER_DETECT_RESULT &result,

@@ -141,13 +141,7 @@ std::string SerializeRouterConf(std::string_view gateway,
         Json::Value(field, field + ::strnlen(field, ZARK_PORTMAP_TEXT_SIZE));
   }
   root[kKeyRouter] = std::move(router);
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = "  ";
-  // Bytes of 0x80 and above are kept as they are (see rule_conf_format).
-  builder["emitUTF8"] = true;
-  std::string text = Json::writeString(builder, root);
-  text.push_back('\n');
-  return text;
+  return WriteJsonText(root);
 }
 
 bool ParseRouterConf(std::string_view text, ZARK_ROUTER_CONF &conf,
@@ -165,13 +159,27 @@ bool ParseRouterConf(std::string_view text, ZARK_ROUTER_CONF &conf,
   }
 }
 
-bool LoadRouterConfForGateway(const std::string &gateway,
-                              ZARK_ROUTER_CONF &conf, int &err) {
+namespace {
+
+// The gateway's canonical dotted quad; nothing, logged and err set to
+// ZARK_PORTMAP_ERR_BAD_PARAMETER, when it is not an IPv4 address.
+std::optional<std::string> CanonicalGatewayOrLog(const std::string &gateway,
+                                                 int &err) {
   std::optional<std::string> canonical = CanonicalGatewayAddress(gateway);
   if (!canonical) {
     ZARK_PM_LOG_ERROR("gateway \"%.64s\" is not an IPv4 address",
                       gateway.c_str());
     err = ZARK_PORTMAP_ERR_BAD_PARAMETER;
+  }
+  return canonical;
+}
+
+} // namespace
+
+bool LoadRouterConfForGateway(const std::string &gateway,
+                              ZARK_ROUTER_CONF &conf, int &err) {
+  std::optional<std::string> canonical = CanonicalGatewayOrLog(gateway, err);
+  if (!canonical) {
     return false;
   }
   const std::string path = RouterConfPath(*canonical);
@@ -202,11 +210,8 @@ bool LoadRouterConfForGateway(const std::string &gateway,
 
 bool StoreRouterConfForGateway(const std::string &gateway,
                                const ZARK_ROUTER_CONF &conf, int &err) {
-  std::optional<std::string> canonical = CanonicalGatewayAddress(gateway);
+  std::optional<std::string> canonical = CanonicalGatewayOrLog(gateway, err);
   if (!canonical) {
-    ZARK_PM_LOG_ERROR("gateway \"%.64s\" is not an IPv4 address",
-                      gateway.c_str());
-    err = ZARK_PORTMAP_ERR_BAD_PARAMETER;
     return false;
   }
   const char *badKey = nullptr;

@@ -1,5 +1,7 @@
 #include "detect/dns_probe.h"
 
+#include "klibc_text.h"
+
 #include "base/local_network.h"
 #include "base/portmap_log.h"
 
@@ -36,15 +38,6 @@ constexpr std::size_t kMaxNameText = 253;
 constexpr std::size_t kMaxLabel = 63;
 // More A records than a 512-byte reply can hold.
 constexpr int kMaxAddresses = 64;
-
-std::string_view Trim(std::string_view text) {
-  const std::size_t start = text.find_first_not_of(" \t\r");
-  if (start == std::string_view::npos) {
-    return {};
-  }
-  const std::size_t end = text.find_last_not_of(" \t\r");
-  return text.substr(start, end - start + 1);
-}
 
 std::string ErrnoText(int error) {
   char buffer[128];
@@ -341,7 +334,8 @@ std::vector<std::string> ParseResolvConf(std::string_view text) {
   std::vector<std::string> servers;
   while (!text.empty() && servers.size() < kMaxNameServers) {
     const std::size_t newline = text.find('\n');
-    std::string_view line = Trim(text.substr(0, newline));
+    std::string_view line =
+        klibc::Trim(text.substr(0, newline), klibc::kSpaceTabAndCr);
     text.remove_prefix(newline == std::string_view::npos ? text.size()
                                                          : newline + 1);
     constexpr std::string_view kKeyword = "nameserver";
@@ -349,7 +343,8 @@ std::vector<std::string> ParseResolvConf(std::string_view text) {
         (line[kKeyword.size()] != ' ' && line[kKeyword.size()] != '\t')) {
       continue;
     }
-    std::string_view value = Trim(line.substr(kKeyword.size()));
+    std::string_view value =
+        klibc::Trim(line.substr(kKeyword.size()), klibc::kSpaceTabAndCr);
     value = value.substr(0, value.find_first_of(" \t#;"));
     if (value.find('\0') != std::string_view::npos) {
       continue;

@@ -24,14 +24,6 @@ using Clock = std::chrono::steady_clock;
 constexpr std::size_t kMaxLocation = 512;
 constexpr std::size_t kMaxDatagram = 2048;
 
-bool SameTextIgnoringCase(std::string_view a, std::string_view b) {
-  return a.size() == b.size() &&
-         std::equal(a.begin(), a.end(), b.begin(), [](char x, char y) {
-           return std::tolower(static_cast<unsigned char>(x)) ==
-                  std::tolower(static_cast<unsigned char>(y));
-         });
-}
-
 bool Printable(std::string_view text) {
   return std::all_of(text.begin(), text.end(), [](char c) {
     return static_cast<unsigned char>(c) > 0x20 &&
@@ -92,11 +84,11 @@ std::optional<SsdpReply> ParseSsdpReply(std::string_view datagram) {
         klibc::Trim(line.substr(0, colon), klibc::kSpaceTabAndCr);
     std::string_view value =
         klibc::Trim(line.substr(colon + 1), klibc::kSpaceTabAndCr);
-    if (SameTextIgnoringCase(name, "LOCATION")) {
+    if (klibc::EqualsIgnoringCase(name, "LOCATION")) {
       reply.location = std::string(value);
-    } else if (SameTextIgnoringCase(name, "ST")) {
+    } else if (klibc::EqualsIgnoringCase(name, "ST")) {
       reply.searchTarget = std::string(value);
-    } else if (SameTextIgnoringCase(name, "SERVER")) {
+    } else if (klibc::EqualsIgnoringCase(name, "SERVER")) {
       reply.server = std::string(value.substr(0, 200));
     }
   }

@@ -151,14 +151,7 @@ std::string SerializeRuleConf(std::span<const RouterRule> rules) {
     item[kKeyServiceName] = TextValue(rule.serviceName);
     array.append(std::move(item));
   }
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = "  ";
-  // Bytes of 0x80 and above go out as they are. Without this the writer
-  // decodes them as UTF-8 and replaces a broken sequence, losing bytes.
-  builder["emitUTF8"] = true;
-  std::string text = Json::writeString(builder, root);
-  text.push_back('\n');
-  return text;
+  return WriteJsonText(root);
 }
 
 } // namespace zark::portmap
