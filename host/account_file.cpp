@@ -185,43 +185,46 @@ LoadAccounts(const std::filesystem::path &file) {
   return accounts;
 }
 
-bool StoreAccount(const std::filesystem::path &file, const Account &account,
-                  std::string &error, std::string &warning) {
-  if (!IsValidAccountName(account.user) || !IsValidAccountName(account.group) ||
-      !IsValidHashText(account.hash)) {
-    error = "the user name, group name or hash is not valid";
+namespace {
+
+// The current content of the accounts file into old: empty when there is
+// none yet. False, with error set, when it exists and cannot be read or
+// is no regular file; warning is set when group or others had access.
+bool ReadOldAccounts(const std::filesystem::path &file, std::string &old,
+                     std::string &error, std::string &warning) {
+  klibc::UniqueFd in(
+      open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
+  if (!in.Valid() && errno != ENOENT) {
+    error = "cannot open " + file.string() + ": " + ErrnoText(errno);
     return false;
   }
-  // The old content, if any.
-  std::string old;
-  {
-    klibc::UniqueFd in(
-        open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
-    if (!in.Valid() && errno != ENOENT) {
-      error = "cannot open " + file.string() + ": " + ErrnoText(errno);
-      return false;
-    }
-    if (in.Valid()) {
-      struct stat info {};
-      if (fstat(in.Get(), &info) != 0 || !S_ISREG(info.st_mode)) {
-        error = file.string() + " is not a regular file";
-        return false;
-      }
-      if ((info.st_mode & 077) != 0) {
-        char octal[8];
-        snprintf(octal, sizeof(octal), "%04o",
-                 static_cast<unsigned>(info.st_mode & 07777));
-        warning = file.string() + " had mode " + octal +
-                  ", readable or writable by group or others; it is now 0600";
-      }
-      int readError = 0;
-      if (!ReadAll(in.Get(), kMaxAccountsFileSize, old, readError)) {
-        error = "cannot read " + file.string() + ": " + ErrnoText(readError);
-        return false;
-      }
-    }
+  if (!in.Valid()) {
+    return true;
   }
+  struct stat info {};
+  if (fstat(in.Get(), &info) != 0 || !S_ISREG(info.st_mode)) {
+    error = file.string() + " is not a regular file";
+    return false;
+  }
+  if ((info.st_mode & 077) != 0) {
+    char octal[8];
+    snprintf(octal, sizeof(octal), "%04o",
+             static_cast<unsigned>(info.st_mode & 07777));
+    warning = file.string() + " had mode " + octal +
+              ", readable or writable by group or others; it is now 0600";
+  }
+  int readError = 0;
+  if (!ReadAll(in.Get(), kMaxAccountsFileSize, old, readError)) {
+    error = "cannot read " + file.string() + ": " + ErrnoText(readError);
+    return false;
+  }
+  return true;
+}
 
+// old with the account's line in place of the first line of the same
+// user (later ones dropped), or added at the end; other lines, comments
+// included, kept as they were.
+std::string WithAccount(std::string_view old, const Account &account) {
   const std::string newLine =
       account.user + ":" + account.hash + ":" + account.group;
   std::string content;
@@ -246,20 +249,15 @@ bool StoreAccount(const std::filesystem::path &file, const Account &account,
     content += newLine;
     content += '\n';
   }
+  return content;
+}
 
-  klibc::ReplaceOptions options;
-  options.mode = 0600;
-  options.tempName = klibc::TempName::kBesidePath;
-  const std::optional<klibc::ReplaceFailure> failure =
-      klibc::ReplaceFile(file.string(), content, options);
-  // The rename reaches the disk with the folder; the new file is in place
-  // even when the folder cannot be flushed.
-  if (klibc::FileWasReplaced(failure)) {
-    return true;
-  }
-  const std::string &temp = failure->tempPath;
+// What went wrong in replacing file, for the user.
+std::string ReplaceFailureText(const klibc::ReplaceFailure &failure,
+                               const std::filesystem::path &file) {
+  const std::string &temp = failure.tempPath;
   std::string what;
-  switch (failure->step) {
+  switch (failure.step) {
   case klibc::ReplaceStep::kCreateTemp:
     what = "cannot create a temporary file beside " + file.string();
     break;
@@ -282,7 +280,33 @@ bool StoreAccount(const std::filesystem::path &file, const Account &account,
     what = "cannot rename " + temp + " to " + file.string();
     break;
   }
-  error = what + ": " + ErrnoText(failure->error);
+  return what + ": " + ErrnoText(failure.error);
+}
+
+} // namespace
+
+bool StoreAccount(const std::filesystem::path &file, const Account &account,
+                  std::string &error, std::string &warning) {
+  if (!IsValidAccountName(account.user) || !IsValidAccountName(account.group) ||
+      !IsValidHashText(account.hash)) {
+    error = "the user name, group name or hash is not valid";
+    return false;
+  }
+  std::string old;
+  if (!ReadOldAccounts(file, old, error, warning)) {
+    return false;
+  }
+  klibc::ReplaceOptions options;
+  options.mode = 0600;
+  options.tempName = klibc::TempName::kBesidePath;
+  const std::optional<klibc::ReplaceFailure> failure =
+      klibc::ReplaceFile(file.string(), WithAccount(old, account), options);
+  // The rename reaches the disk with the folder; the new file is in place
+  // even when the folder cannot be flushed.
+  if (klibc::FileWasReplaced(failure)) {
+    return true;
+  }
+  error = ReplaceFailureText(*failure, file);
   return false;
 }
 

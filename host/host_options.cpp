@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <charconv>
+#include <chrono>
 #include <cstdint>
 #include <optional>
 #include <vector>
@@ -99,32 +100,109 @@ std::string RefusedOption(int got, char *const *argv) {
   return written;
 }
 
+namespace {
+
+// Values of getopt_long for the options without a short form.
+enum : int {
+  kListen = 256,
+  kModules,
+  kAccounts,
+  kWww,
+  kThreads,
+  kSessionIdle,
+  kSessionMax,
+  kSecureCookie,
+};
+
+const option kHostOptions[] = {
+    {"help", no_argument, nullptr, 'h'},
+    {"listen", required_argument, nullptr, kListen},
+    {"modules", required_argument, nullptr, kModules},
+    {"accounts", required_argument, nullptr, kAccounts},
+    {"www", required_argument, nullptr, kWww},
+    {"threads", required_argument, nullptr, kThreads},
+    {"session-idle", required_argument, nullptr, kSessionIdle},
+    {"session-max", required_argument, nullptr, kSessionMax},
+    {"secure-cookie", no_argument, nullptr, kSecureCookie},
+    {nullptr, 0, nullptr, 0},
+};
+
+// The value of the option `name` as whole seconds, 1 to max.
+std::optional<std::chrono::milliseconds> ParseSeconds(const char *value,
+                                                      const std::string &name,
+                                                      std::int64_t max,
+                                                      std::string &error) {
+  std::optional<std::int64_t> number = ParseNumber(value, 1, max);
+  if (!number) {
+    error = name + " takes whole seconds, 1 to " + std::to_string(max);
+    return std::nullopt;
+  }
+  return std::chrono::seconds(*number);
+}
+
+// Stores one known option of the table (other than --help) in options;
+// false, with error set, when its value is refused.
+bool ApplyHostOption(int got, const char *value, const std::string &name,
+                     HostOptions &options, std::string &error) {
+  switch (got) {
+  case kSecureCookie:
+    options.secureCookie = true;
+    break;
+  case kListen:
+    if (!ParseListen(value, options.http.address, options.http.port)) {
+      error = "--listen takes ADDRESS:PORT, for example 127.0.0.1:5000";
+      return false;
+    }
+    break;
+  case kModules:
+    options.modulesFolder = value;
+    break;
+  case kAccounts:
+    options.accountsFile = value;
+    break;
+  case kWww:
+    options.http.wwwFolder = value;
+    break;
+  case kThreads: {
+    std::optional<std::int64_t> number = ParseNumber(value, 1, 256);
+    if (!number) {
+      error = "--threads takes 1 to 256";
+      return false;
+    }
+    options.http.threads = static_cast<std::size_t>(*number);
+    break;
+  }
+  case kSessionIdle: {
+    auto idle = ParseSeconds(value, name, 7 * 24 * 3600, error);
+    if (!idle) {
+      return false;
+    }
+    options.sessions.idleTimeout = *idle;
+    break;
+  }
+  case kSessionMax: {
+    auto max = ParseSeconds(value, name, 30 * 24 * 3600, error);
+    if (!max) {
+      return false;
+    }
+    options.sessions.maxLifetime = *max;
+    break;
+  }
+  default:
+    break;
+  }
+  return true;
+}
+
+bool IsTableOption(int got) {
+  return got >= kListen && got <= kSecureCookie;
+}
+
+} // namespace
+
 OptionsResult ParseHostOptions(std::span<const std::string> args,
                                HostOptions &options, std::string &error) {
   options.http.wwwFolder = DefaultWwwFolder();
-  // Values of getopt_long for the options without a short form.
-  enum : int {
-    kListen = 256,
-    kModules,
-    kAccounts,
-    kWww,
-    kThreads,
-    kSessionIdle,
-    kSessionMax,
-    kSecureCookie,
-  };
-  static const option kOptions[] = {
-      {"help", no_argument, nullptr, 'h'},
-      {"listen", required_argument, nullptr, kListen},
-      {"modules", required_argument, nullptr, kModules},
-      {"accounts", required_argument, nullptr, kAccounts},
-      {"www", required_argument, nullptr, kWww},
-      {"threads", required_argument, nullptr, kThreads},
-      {"session-idle", required_argument, nullptr, kSessionIdle},
-      {"session-max", required_argument, nullptr, kSessionMax},
-      {"secure-cookie", no_argument, nullptr, kSecureCookie},
-      {nullptr, 0, nullptr, 0},
-  };
   ArgumentVector arguments("zark-webapid", args);
   char **argv = arguments.Get();
   const int argc = arguments.Count();
@@ -135,72 +213,25 @@ OptionsResult ParseHostOptions(std::span<const std::string> args,
   opterr = 0;
   for (;;) {
     int index = -1;
-    const int got = getopt_long(argc, argv, "+:h", kOptions, &index);
+    const int got = getopt_long(argc, argv, "+:h", kHostOptions, &index);
     if (got == -1) {
       break;
     }
-    const std::string name =
-        index >= 0 ? "--" + std::string(kOptions[index].name) : std::string();
-    auto seconds =
-        [&](std::int64_t max) -> std::optional<std::chrono::milliseconds> {
-      std::optional<std::int64_t> number = ParseNumber(optarg, 1, max);
-      if (!number) {
-        error = name + " takes whole seconds, 1 to " + std::to_string(max);
-        return std::nullopt;
-      }
-      return std::chrono::seconds(*number);
-    };
-    switch (got) {
-    case 'h':
+    if (got == 'h') {
       return OptionsResult::Help;
-    case ':':
+    }
+    if (got == ':') {
       error = RefusedOption(got, argv) + " needs a value";
       return OptionsResult::Error;
-    case kSecureCookie:
-      options.secureCookie = true;
-      break;
-    case kListen:
-      if (!ParseListen(optarg, options.http.address, options.http.port)) {
-        error = "--listen takes ADDRESS:PORT, for example 127.0.0.1:5000";
-        return OptionsResult::Error;
-      }
-      break;
-    case kModules:
-      options.modulesFolder = optarg;
-      break;
-    case kAccounts:
-      options.accountsFile = optarg;
-      break;
-    case kWww:
-      options.http.wwwFolder = optarg;
-      break;
-    case kThreads: {
-      std::optional<std::int64_t> number = ParseNumber(optarg, 1, 256);
-      if (!number) {
-        error = "--threads takes 1 to 256";
-        return OptionsResult::Error;
-      }
-      options.http.threads = static_cast<std::size_t>(*number);
-      break;
     }
-    case kSessionIdle: {
-      auto idle = seconds(7 * 24 * 3600);
-      if (!idle) {
-        return OptionsResult::Error;
-      }
-      options.sessions.idleTimeout = *idle;
-      break;
-    }
-    case kSessionMax: {
-      auto max = seconds(30 * 24 * 3600);
-      if (!max) {
-        return OptionsResult::Error;
-      }
-      options.sessions.maxLifetime = *max;
-      break;
-    }
-    default:
+    if (!IsTableOption(got)) {
       error = "unknown option " + RefusedOption(got, argv);
+      return OptionsResult::Error;
+    }
+    const std::string name = index >= 0
+                                 ? "--" + std::string(kHostOptions[index].name)
+                                 : std::string();
+    if (!ApplyHostOption(got, optarg, name, options, error)) {
       return OptionsResult::Error;
     }
   }

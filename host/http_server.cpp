@@ -109,6 +109,129 @@ bool UsableWwwFolder(const std::filesystem::path &folder) {
   return true;
 }
 
+// Threads, timeouts, the body bound and the headers of every answer.
+void ApplyLimits(httplib::Server &server, const HttpOptions &options) {
+  const std::size_t threads = options.threads == 0 ? 1 : options.threads;
+  // The library owns and deletes the queue that this factory makes.
+  server.new_task_queue = [threads] {
+    return new httplib::ThreadPool(threads);
+  };
+  server.set_read_timeout(options.readTimeout);
+  server.set_write_timeout(options.writeTimeout);
+  server.set_keep_alive_timeout(options.keepAliveTimeout.count());
+  server.set_keep_alive_max_count(options.keepAliveMaxCount);
+  // Bodies beyond the bound are refused (413) and skipped by the library
+  // before any handler sees them.
+  server.set_payload_max_length(options.maxBodyBytes);
+  server.set_default_headers({{"X-Content-Type-Options", "nosniff"},
+                              {"X-Frame-Options", "DENY"},
+                              {"Referrer-Policy", "no-referrer"}});
+}
+
+// The answer when a POST body could not be read whole.
+void SendBodyRefusal(httplib::Response &response, std::size_t maxBodyBytes) {
+  // 413 from the library: more than the payload bound. Otherwise the
+  // client sent a broken body or went away.
+  if (response.status == 413) {
+    Json::Value errors(Json::objectValue);
+    errors["limit"] = "body";
+    errors["max"] = static_cast<Json::UInt64>(maxBodyBytes);
+    SendJson(response, 413, ErrorAnswer(ZARK::WEBAPI_ERR_TOO_LARGE, errors));
+  } else {
+    Json::Value errors(Json::objectValue);
+    errors["reason"] = "body";
+    SendJson(response, 400, ErrorAnswer(ZARK::WEBAPI_ERR_BAD_REQUEST, errors));
+  }
+}
+
+// GET and POST of the API endpoints, answered by handler.
+void RouteApi(httplib::Server &server, const RequestHandler &handler,
+              std::size_t maxBodyBytes) {
+  server.Get(kApiPattern, [&handler](const httplib::Request &request,
+                                     httplib::Response &response) {
+    ReceivedRequest received;
+    WebRequest web = ToWebRequest(request, received);
+    SendAnswer(response, handler.Handle(web));
+  });
+
+  server.Post(kApiPattern,
+              [&handler, maxBodyBytes](const httplib::Request &request,
+                                       httplib::Response &response,
+                                       const httplib::ContentReader &reader) {
+                ReceivedRequest received;
+                bool read =
+                    reader([&received](const char *data, std::size_t length) {
+                      received.body.append(data, length);
+                      return true;
+                    });
+                if (!read) {
+                  SendBodyRefusal(response, maxBodyBytes);
+                  return;
+                }
+                WebRequest web = ToWebRequest(request, received);
+                web.isPost = true;
+                web.body = received.body;
+                received.contentType = request.get_header_value("Content-Type");
+                web.contentType = received.contentType;
+                SendAnswer(response, handler.Handle(web));
+              });
+}
+
+// A JSON body for an error the library answered under /webapi/.
+httplib::Server::HandlerResponse
+AnswerLibraryError(const httplib::Request &request,
+                   httplib::Response &response) {
+  if (!IsApiPath(request.path) || !response.body.empty()) {
+    return httplib::Server::HandlerResponse::Unhandled;
+  }
+  int code = ZARK::WEBAPI_ERR_BAD_REQUEST;
+  if (response.status == 413 || response.status == 414 ||
+      response.status == 431) {
+    code = ZARK::WEBAPI_ERR_TOO_LARGE;
+  } else if (response.status >= 500) {
+    code = ZARK::WEBAPI_ERR_UNKNOWN;
+  }
+  SendJson(response, response.status, ErrorAnswer(code));
+  return httplib::Server::HandlerResponse::Handled;
+}
+
+// A handler threw: logged, and answered with a 500.
+void AnswerException(const httplib::Request &request,
+                     httplib::Response &response,
+                     const std::exception_ptr &exception) {
+  std::string what = "unknown";
+  try {
+    if (exception) {
+      std::rethrow_exception(exception);
+    }
+  } catch (const std::exception &e) {
+    what = e.what();
+  } catch (...) {
+  }
+  HOST_LOG(LOG_ERR, "request for %s failed: %s", request.path.c_str(),
+           what.c_str());
+  SendJson(response, 500, ErrorAnswer(ZARK::WEBAPI_ERR_UNKNOWN));
+}
+
+// The front end from the www folder, or the built-in page when it cannot
+// be served.
+void RouteFrontEnd(httplib::Server &server,
+                   const std::filesystem::path &wwwFolder) {
+  if (UsableWwwFolder(wwwFolder)) {
+    if (!server.set_mount_point("/", wwwFolder.string())) {
+      HOST_LOG(LOG_ERR, "www folder %s cannot be served", wwwFolder.c_str());
+    } else {
+      HOST_LOG(LOG_INFO, "serving the front end from %s", wwwFolder.c_str());
+      return;
+    }
+  }
+  auto page = [](const httplib::Request &, httplib::Response &response) {
+    response.set_content(BuiltInPage(), "text/html; charset=utf-8");
+  };
+  server.Get("/", page);
+  server.Get("/index.html", page);
+}
+
 } // namespace
 
 std::string BuiltInPage() {
@@ -133,113 +256,14 @@ HttpServer::~HttpServer() {
 
 void HttpServer::Route() {
   httplib::Server &server = *mServer;
-  const std::size_t threads = mOptions.threads == 0 ? 1 : mOptions.threads;
-  // The library owns and deletes the queue that this factory makes.
-  server.new_task_queue = [threads] {
-    return new httplib::ThreadPool(threads);
-  };
-  server.set_read_timeout(mOptions.readTimeout);
-  server.set_write_timeout(mOptions.writeTimeout);
-  server.set_keep_alive_timeout(mOptions.keepAliveTimeout.count());
-  server.set_keep_alive_max_count(mOptions.keepAliveMaxCount);
-  // Bodies beyond the bound are refused (413) and skipped by the library
-  // before any handler sees them.
-  server.set_payload_max_length(mOptions.maxBodyBytes);
-  server.set_default_headers({{"X-Content-Type-Options", "nosniff"},
-                              {"X-Frame-Options", "DENY"},
-                              {"Referrer-Policy", "no-referrer"}});
-
-  server.Get(kApiPattern, [this](const httplib::Request &request,
-                                 httplib::Response &response) {
-    ReceivedRequest received;
-    WebRequest web = ToWebRequest(request, received);
-    SendAnswer(response, mHandler.Handle(web));
-  });
-
-  server.Post(kApiPattern, [this](const httplib::Request &request,
-                                  httplib::Response &response,
-                                  const httplib::ContentReader &reader) {
-    ReceivedRequest received;
-    bool read = reader([&received](const char *data, std::size_t length) {
-      received.body.append(data, length);
-      return true;
-    });
-    if (!read) {
-      // 413 from the library: more than the payload bound. Otherwise the
-      // client sent a broken body or went away.
-      if (response.status == 413) {
-        Json::Value errors(Json::objectValue);
-        errors["limit"] = "body";
-        errors["max"] = static_cast<Json::UInt64>(mOptions.maxBodyBytes);
-        SendJson(response, 413,
-                 ErrorAnswer(ZARK::WEBAPI_ERR_TOO_LARGE, errors));
-      } else {
-        Json::Value errors(Json::objectValue);
-        errors["reason"] = "body";
-        SendJson(response, 400,
-                 ErrorAnswer(ZARK::WEBAPI_ERR_BAD_REQUEST, errors));
-      }
-      return;
-    }
-    WebRequest web = ToWebRequest(request, received);
-    web.isPost = true;
-    web.body = received.body;
-    received.contentType = request.get_header_value("Content-Type");
-    web.contentType = received.contentType;
-    SendAnswer(response, mHandler.Handle(web));
-  });
-
+  ApplyLimits(server, mOptions);
+  RouteApi(server, mHandler, mOptions.maxBodyBytes);
   // Failures the library answers itself (bounds, unknown paths under
   // /webapi/) get a JSON body there too.
-  httplib::Server::HandlerWithResponse errorHandler =
-      [](const httplib::Request &request,
-         httplib::Response &response) -> httplib::Server::HandlerResponse {
-    if (!IsApiPath(request.path) || !response.body.empty()) {
-      return httplib::Server::HandlerResponse::Unhandled;
-    }
-    int code = ZARK::WEBAPI_ERR_BAD_REQUEST;
-    if (response.status == 413 || response.status == 414 ||
-        response.status == 431) {
-      code = ZARK::WEBAPI_ERR_TOO_LARGE;
-    } else if (response.status >= 500) {
-      code = ZARK::WEBAPI_ERR_UNKNOWN;
-    }
-    SendJson(response, response.status, ErrorAnswer(code));
-    return httplib::Server::HandlerResponse::Handled;
-  };
+  httplib::Server::HandlerWithResponse errorHandler = AnswerLibraryError;
   server.set_error_handler(std::move(errorHandler));
-  server.set_exception_handler([](const httplib::Request &request,
-                                  httplib::Response &response,
-                                  const std::exception_ptr &exception) {
-    std::string what = "unknown";
-    try {
-      if (exception) {
-        std::rethrow_exception(exception);
-      }
-    } catch (const std::exception &e) {
-      what = e.what();
-    } catch (...) {
-    }
-    HOST_LOG(LOG_ERR, "request for %s failed: %s", request.path.c_str(),
-             what.c_str());
-    SendJson(response, 500, ErrorAnswer(ZARK::WEBAPI_ERR_UNKNOWN));
-  });
-
-  if (UsableWwwFolder(mOptions.wwwFolder)) {
-    if (!server.set_mount_point("/", mOptions.wwwFolder.string())) {
-      HOST_LOG(LOG_ERR, "www folder %s cannot be served",
-               mOptions.wwwFolder.c_str());
-    } else {
-      HOST_LOG(LOG_INFO, "serving the front end from %s",
-               mOptions.wwwFolder.c_str());
-      return;
-    }
-  }
-  auto page = [](const httplib::Request &, httplib::Response &response) {
-    response.set_content(BuiltInPage(), "text/html; charset=utf-8");
-  };
-  server.Get("/", page);
-  server.Get("/index.html", page);
+  server.set_exception_handler(AnswerException);
+  RouteFrontEnd(server, mOptions.wwwFolder);
 }
 
 bool HttpServer::Bind() {

@@ -81,13 +81,19 @@ int Usage(std::ostream &err, const std::string &problem) {
   return 2;
 }
 
-} // namespace
-
-int RunPasswdCommand(std::span<const std::string> args, PasswordInput input,
-                     std::ostream &err) {
-  std::optional<std::string> user;
+// What the command line of "passwd" names.
+struct PasswdRequest {
+  std::string user;
   std::filesystem::path file = DefaultAccountsFile();
-  std::string group(kAdminGroup);
+  std::string group{kAdminGroup};
+};
+
+// Reads the user's name and the options into request. Nothing when they
+// are usable; otherwise the exit status, after the usage went to err.
+std::optional<int> ParsePasswdArguments(std::span<const std::string> args,
+                                        PasswdRequest &request,
+                                        std::ostream &err) {
+  std::optional<std::string> user;
   enum : int { kAccounts = 256, kGroup };
   static const option kOptions[] = {
       {"accounts", required_argument, nullptr, kAccounts},
@@ -107,9 +113,9 @@ int RunPasswdCommand(std::span<const std::string> args, PasswordInput input,
       break;
     }
     if (got == kAccounts) {
-      file = optarg;
+      request.file = optarg;
     } else if (got == kGroup) {
-      group = optarg;
+      request.group = optarg;
     } else if (got == ':') {
       return Usage(err, RefusedOption(got, argv) + " needs a value");
     } else {
@@ -129,27 +135,68 @@ int RunPasswdCommand(std::span<const std::string> args, PasswordInput input,
     return Usage(err, "a user name has 1 to 64 characters of A-Z a-z 0-9 . _ "
                       "- and does not begin with -");
   }
-  if (!IsValidAccountName(group)) {
+  if (!IsValidAccountName(request.group)) {
     return Usage(err, "a group name has 1 to 64 characters of A-Z a-z 0-9 . "
                       "_ - and does not begin with -");
   }
+  request.user = *user;
+  return std::nullopt;
+}
 
-  Secret password;
+// Reads the new password (twice on a terminal) and checks its length;
+// false after telling err why not.
+bool ReadNewPassword(PasswordInput &input, Secret &password,
+                     std::ostream &err) {
   if (!ReadLine(input, "Password: ", password)) {
     err << "zark-webapid passwd: no password given\n";
-    return 1;
+    return false;
   }
   if (input.terminal) {
     Secret again;
     if (!ReadLine(input, "Password again: ", again) ||
         again.Text() != password.Text()) {
       err << "zark-webapid passwd: the passwords differ; nothing changed\n";
-      return 1;
+      return false;
     }
   }
   if (password.Text().empty() || password.Text().size() > kMaxPasswordLength) {
     err << "zark-webapid passwd: a password has 1 to " << kMaxPasswordLength
         << " bytes; nothing changed\n";
+    return false;
+  }
+  return true;
+}
+
+// Writes the account with its new hash; the exit status of the command.
+int StoreNewHash(const PasswdRequest &request, const std::string &hash,
+                 std::ostream &err) {
+  std::string error;
+  std::string warning;
+  if (!StoreAccount(request.file, Account{request.user, hash, request.group},
+                    error, warning)) {
+    err << "zark-webapid passwd: " << error << "; nothing changed\n";
+    HOST_LOG(LOG_ERR, "password of %s not set in %s: %s", request.user.c_str(),
+             request.file.c_str(), error.c_str());
+    return 1;
+  }
+  if (!warning.empty()) {
+    err << "zark-webapid passwd: " << warning << "\n";
+  }
+  HOST_LOG(LOG_NOTICE, "password of %s (group %s) set in %s",
+           request.user.c_str(), request.group.c_str(), request.file.c_str());
+  return 0;
+}
+
+} // namespace
+
+int RunPasswdCommand(std::span<const std::string> args, PasswordInput input,
+                     std::ostream &err) {
+  PasswdRequest request;
+  if (std::optional<int> status = ParsePasswdArguments(args, request, err)) {
+    return *status;
+  }
+  Secret password;
+  if (!ReadNewPassword(input, password, err)) {
     return 1;
   }
   std::optional<std::string> hash = HashPassword(password.Text());
@@ -159,20 +206,7 @@ int RunPasswdCommand(std::span<const std::string> args, PasswordInput input,
            "changed\n";
     return 1;
   }
-  std::string error;
-  std::string warning;
-  if (!StoreAccount(file, Account{*user, *hash, group}, error, warning)) {
-    err << "zark-webapid passwd: " << error << "; nothing changed\n";
-    HOST_LOG(LOG_ERR, "password of %s not set in %s: %s", user->c_str(),
-             file.c_str(), error.c_str());
-    return 1;
-  }
-  if (!warning.empty()) {
-    err << "zark-webapid passwd: " << warning << "\n";
-  }
-  HOST_LOG(LOG_NOTICE, "password of %s (group %s) set in %s", user->c_str(),
-           group.c_str(), file.c_str());
-  return 0;
+  return StoreNewHash(request, *hash, err);
 }
 
 } // namespace zark::host

@@ -74,6 +74,72 @@ bool QueryHasField(std::string_view query, std::string_view name) {
   return false;
 }
 
+// The fields of an auth request by name; kept empty with the answer in
+// refusal when a field is given twice.
+using FieldValues = std::map<std::string_view, std::string_view>;
+
+bool IndexFields(const FormFields &fields, FieldValues &values,
+                 WebAnswer &refusal) {
+  for (const FormField &field : fields) {
+    if (!values.emplace(field.name, field.value).second) {
+      Json::Value errors(Json::objectValue);
+      errors["field"] = field.name;
+      errors["reason"] = "repeated";
+      refusal = Answer(ErrorAnswer(ZARK::WEBAPI_ERR_BAD_REQUEST, errors));
+      return false;
+    }
+  }
+  return true;
+}
+
+// The value of field name, nothing when it is absent or empty.
+std::optional<std::string_view> NonEmptyField(const FieldValues &values,
+                                              const char *name) {
+  auto it = values.find(name);
+  if (it == values.end() || it->second.empty()) {
+    return std::nullopt;
+  }
+  return it->second;
+}
+
+WebAnswer MissingField(const char *name) {
+  Json::Value errors(Json::objectValue);
+  errors["field"] = name;
+  return Answer(ErrorAnswer(ZARK::WEBAPI_ERR_BAD_REQUEST, errors));
+}
+
+// The answer to a login attempt: the session's token and cookie, or why
+// not.
+WebAnswer LoginAnswer(const LoginOutcome &outcome, bool secureCookie) {
+  switch (outcome.result) {
+  case LoginOutcome::Result::Ok: {
+    Json::Value data(Json::objectValue);
+    data["token"] = outcome.session.token;
+    data["account"] = outcome.owner.account;
+    WebAnswer answer = Answer(SuccessAnswer(data));
+    answer.headers.emplace_back(
+        "Set-Cookie", SessionCookie(outcome.session.id, secureCookie, false));
+    return answer;
+  }
+  case LoginOutcome::Result::BadCredentials:
+    return Answer(
+        ErrorAnswer(ZARK::WEBAPI_ERR_NOT_ALLOWED, Reason("bad_credentials")));
+  case LoginOutcome::Result::Throttled: {
+    Json::Value errors = Reason("throttled");
+    errors["retry_after"] =
+        static_cast<Json::Int64>(outcome.retryAfter.count());
+    WebAnswer answer =
+        Answer(ErrorAnswer(ZARK::WEBAPI_ERR_NOT_ALLOWED, errors));
+    answer.headers.emplace_back("Retry-After",
+                                std::to_string(outcome.retryAfter.count()));
+    return answer;
+  }
+  case LoginOutcome::Result::Unavailable:
+    break;
+  }
+  return Answer(ErrorAnswer(ZARK::WEBAPI_ERR_UNKNOWN));
+}
+
 } // namespace
 
 std::string_view FindCookie(std::string_view cookies, std::string_view name) {
@@ -247,44 +313,17 @@ WebAnswer RequestHandler::HandleQuery(const WebRequest &request) const {
 
 WebAnswer RequestHandler::HandleAuth(const WebRequest &request,
                                      const FormFields &fields) const {
-  std::map<std::string_view, std::string_view> values;
-  for (const FormField &field : fields) {
-    if (!values.emplace(field.name, field.value).second) {
-      Json::Value errors(Json::objectValue);
-      errors["field"] = field.name;
-      errors["reason"] = "repeated";
-      return Answer(ErrorAnswer(ZARK::WEBAPI_ERR_BAD_REQUEST, errors));
-    }
+  FieldValues values;
+  WebAnswer refusal;
+  if (!IndexFields(fields, values, refusal)) {
+    return refusal;
   }
-  auto field = [&values](const char *name) -> std::optional<std::string_view> {
-    auto it = values.find(name);
-    if (it == values.end()) {
-      return std::nullopt;
-    }
-    return it->second;
-  };
-  auto missing = [](const char *name) {
-    Json::Value errors(Json::objectValue);
-    errors["field"] = name;
-    return Answer(ErrorAnswer(ZARK::WEBAPI_ERR_BAD_REQUEST, errors));
-  };
-
-  std::optional<std::string_view> method = field("method");
-  if (!method || method->empty()) {
-    return missing("method");
+  std::optional<std::string_view> method = NonEmptyField(values, "method");
+  if (!method) {
+    return MissingField("method");
   }
   if (*method == "logout") {
-    SessionOwner owner;
-    WebAnswer refusal;
-    if (!CheckSession(request, owner, refusal)) {
-      return refusal;
-    }
-    mSessions.Drop(FindCookie(request.cookies, kSessionCookie));
-    HOST_LOG(LOG_INFO, "logout of %s", owner.account.c_str());
-    WebAnswer answer = Answer(SuccessAnswer(Json::Value()));
-    answer.headers.emplace_back("Set-Cookie",
-                                SessionCookie("", mSecureCookie, true));
-    return answer;
+    return HandleLogout(request);
   }
   if (*method != "login") {
     return Answer(ErrorAnswer(ZARK::WEBAPI_ERR_NO_SUCH_METHOD));
@@ -295,44 +334,32 @@ WebAnswer RequestHandler::HandleAuth(const WebRequest &request,
     return Answer(
         ErrorAnswer(ZARK::WEBAPI_ERR_BAD_REQUEST, Reason("post_required")));
   }
-  std::optional<std::string_view> account = field(kAccountField);
-  if (!account || account->empty()) {
-    return missing(kAccountField);
+  std::optional<std::string_view> account =
+      NonEmptyField(values, kAccountField);
+  if (!account) {
+    return MissingField(kAccountField);
   }
-  std::optional<std::string_view> password = field(kPasswordField);
-  if (!password || password->empty()) {
-    return missing(kPasswordField);
+  std::optional<std::string_view> password =
+      NonEmptyField(values, kPasswordField);
+  if (!password) {
+    return MissingField(kPasswordField);
   }
+  return LoginAnswer(mLogins.Login(*account, *password, request.clientAddress),
+                     mSecureCookie);
+}
 
-  LoginOutcome outcome =
-      mLogins.Login(*account, *password, request.clientAddress);
-  switch (outcome.result) {
-  case LoginOutcome::Result::Ok: {
-    Json::Value data(Json::objectValue);
-    data["token"] = outcome.session.token;
-    data["account"] = outcome.owner.account;
-    WebAnswer answer = Answer(SuccessAnswer(data));
-    answer.headers.emplace_back(
-        "Set-Cookie", SessionCookie(outcome.session.id, mSecureCookie, false));
-    return answer;
+WebAnswer RequestHandler::HandleLogout(const WebRequest &request) const {
+  SessionOwner owner;
+  WebAnswer refusal;
+  if (!CheckSession(request, owner, refusal)) {
+    return refusal;
   }
-  case LoginOutcome::Result::BadCredentials:
-    return Answer(
-        ErrorAnswer(ZARK::WEBAPI_ERR_NOT_ALLOWED, Reason("bad_credentials")));
-  case LoginOutcome::Result::Throttled: {
-    Json::Value errors = Reason("throttled");
-    errors["retry_after"] =
-        static_cast<Json::Int64>(outcome.retryAfter.count());
-    WebAnswer answer =
-        Answer(ErrorAnswer(ZARK::WEBAPI_ERR_NOT_ALLOWED, errors));
-    answer.headers.emplace_back("Retry-After",
-                                std::to_string(outcome.retryAfter.count()));
-    return answer;
-  }
-  case LoginOutcome::Result::Unavailable:
-    break;
-  }
-  return Answer(ErrorAnswer(ZARK::WEBAPI_ERR_UNKNOWN));
+  mSessions.Drop(FindCookie(request.cookies, kSessionCookie));
+  HOST_LOG(LOG_INFO, "logout of %s", owner.account.c_str());
+  WebAnswer answer = Answer(SuccessAnswer(Json::Value()));
+  answer.headers.emplace_back("Set-Cookie",
+                              SessionCookie("", mSecureCookie, true));
+  return answer;
 }
 
 } // namespace zark::host

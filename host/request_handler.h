@@ -79,6 +79,8 @@ private:
   [[nodiscard]] WebAnswer HandleQuery(const WebRequest &request) const;
   [[nodiscard]] WebAnswer HandleAuth(const WebRequest &request,
                                      const FormFields &fields) const;
+  // Ends the request's session and expires its cookie.
+  [[nodiscard]] WebAnswer HandleLogout(const WebRequest &request) const;
   // 106 or 107 into refusal when the request has no valid session.
   [[nodiscard]] bool CheckSession(const WebRequest &request,
                                   SessionOwner &owner,

@@ -12,6 +12,7 @@
 #include <cstring>
 #include <ctime>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -56,40 +57,116 @@ void LogLine(const std::string &line) {
   std::fprintf(stderr, "%s zark-probed: %s\n", stamp, line.c_str());
 }
 
-} // namespace
+// Values of getopt_long for the options without a short form.
+enum : int {
+  kQuiet = 256,
+  kListen,
+  kRate,
+  kBurst,
+  kMaxSessions,
+  kMaxPerAddress,
+  kMaxRequests,
+  kIdleTimeout,
+  kConnectTimeout,
+  kAnswerTimeout,
+};
 
-int main(int argc, char **argv) {
+const option kOptions[] = {
+    {"help", no_argument, nullptr, 'h'},
+    {"quiet", no_argument, nullptr, kQuiet},
+    {"listen", required_argument, nullptr, kListen},
+    {"rate", required_argument, nullptr, kRate},
+    {"burst", required_argument, nullptr, kBurst},
+    {"max-sessions", required_argument, nullptr, kMaxSessions},
+    {"max-per-address", required_argument, nullptr, kMaxPerAddress},
+    {"max-requests", required_argument, nullptr, kMaxRequests},
+    {"idle-timeout", required_argument, nullptr, kIdleTimeout},
+    {"connect-timeout", required_argument, nullptr, kConnectTimeout},
+    {"answer-timeout", required_argument, nullptr, kAnswerTimeout},
+    {nullptr, 0, nullptr, 0},
+};
+
+struct CommandLine {
   ServerOptions options;
   CheckTimeouts timeouts;
   bool quiet = false;
   bool listenGiven = false;
-  // Values of getopt_long for the options without a short form.
-  enum : int {
-    kQuiet = 256,
-    kListen,
-    kRate,
-    kBurst,
-    kMaxSessions,
-    kMaxPerAddress,
-    kMaxRequests,
-    kIdleTimeout,
-    kConnectTimeout,
-    kAnswerTimeout,
-  };
-  static const option kOptions[] = {
-      {"help", no_argument, nullptr, 'h'},
-      {"quiet", no_argument, nullptr, kQuiet},
-      {"listen", required_argument, nullptr, kListen},
-      {"rate", required_argument, nullptr, kRate},
-      {"burst", required_argument, nullptr, kBurst},
-      {"max-sessions", required_argument, nullptr, kMaxSessions},
-      {"max-per-address", required_argument, nullptr, kMaxPerAddress},
-      {"max-requests", required_argument, nullptr, kMaxRequests},
-      {"idle-timeout", required_argument, nullptr, kIdleTimeout},
-      {"connect-timeout", required_argument, nullptr, kConnectTimeout},
-      {"answer-timeout", required_argument, nullptr, kAnswerTimeout},
-      {nullptr, 0, nullptr, 0},
-  };
+};
+
+// Stores the value of one option with an argument (or --quiet) in
+// `line`; false when the value is out of its range.
+bool ApplyOption(int got, std::string_view value, CommandLine &line) {
+  long long number = 0;
+  bool ok = true;
+  switch (got) {
+  case kQuiet:
+    line.quiet = true;
+    break;
+  case kListen:
+    // The first --listen replaces the default address.
+    if (!line.listenGiven) {
+      line.options.listen.clear();
+      line.listenGiven = true;
+    }
+    line.options.listen.emplace_back(value);
+    break;
+  case kRate:
+    ok = ParseNumber(value, 1, 100000, number);
+    line.options.ratePerSecond = static_cast<double>(number);
+    break;
+  case kBurst:
+    ok = ParseNumber(value, 1, 100000, number);
+    line.options.burst = static_cast<double>(number);
+    break;
+  case kMaxSessions:
+    ok = ParseNumber(value, 1, 10000, number);
+    line.options.maxSessions = static_cast<int>(number);
+    break;
+  case kMaxPerAddress:
+    ok = ParseNumber(value, 1, 10000, number);
+    line.options.maxSessionsPerAddress = static_cast<int>(number);
+    break;
+  case kMaxRequests:
+    ok = ParseNumber(value, 1, 100000, number);
+    line.options.maxRequestsPerSession = static_cast<int>(number);
+    break;
+  case kIdleTimeout:
+    ok = ParseNumber(value, 1, 600000, number);
+    line.options.idleTimeout = std::chrono::milliseconds(number);
+    break;
+  case kConnectTimeout:
+    ok = ParseNumber(value, 1, 60000, number);
+    line.timeouts.connect = std::chrono::milliseconds(number);
+    break;
+  case kAnswerTimeout:
+    ok = ParseNumber(value, 1, 60000, number);
+    line.timeouts.answer = std::chrono::milliseconds(number);
+    break;
+  default:
+    break;
+  }
+  return ok;
+}
+
+// Reports a missing value (':') or an unknown option ('?').
+void ReportOptionError(int got, char **argv) {
+  // getopt_long has stepped past the element holding the option, or
+  // names an unknown short one in optopt.
+  std::string written = argv[optind - 1];
+  if (got == '?' && optopt > 0 && optopt < 256) {
+    written = std::string("-") + static_cast<char>(optopt);
+  }
+  std::fprintf(stderr,
+               got == ':' ? "zark-probed: %s needs a value\n"
+                          : "zark-probed: unknown option %s\n",
+               written.substr(0, written.find('=')).c_str());
+  PrintUsage(stderr);
+}
+
+// Reads the command line into `line`. Returns the exit status when the
+// program must end here (0 after --help, 2 on a usage error), nothing
+// when the service should start.
+std::optional<int> ParseCommandLine(int argc, char **argv, CommandLine &line) {
   // "+": stop at the first argument that is no option; ":": report a
   // missing value apart. getopt_long's own messages stay off.
   opterr = 0;
@@ -104,69 +181,11 @@ int main(int argc, char **argv) {
       return 0;
     }
     if (got == ':' || got == '?') {
-      // getopt_long has stepped past the element holding the option, or
-      // names an unknown short one in optopt.
-      std::string written = argv[optind - 1];
-      if (got == '?' && optopt > 0 && optopt < 256) {
-        written = std::string("-") + static_cast<char>(optopt);
-      }
-      std::fprintf(stderr,
-                   got == ':' ? "zark-probed: %s needs a value\n"
-                              : "zark-probed: unknown option %s\n",
-                   written.substr(0, written.find('=')).c_str());
-      PrintUsage(stderr);
+      ReportOptionError(got, argv);
       return 2;
     }
     const std::string_view value = optarg != nullptr ? optarg : "";
-    long long number = 0;
-    bool ok = true;
-    switch (got) {
-    case kQuiet:
-      quiet = true;
-      break;
-    case kListen:
-      if (!listenGiven) {
-        options.listen.clear();
-        listenGiven = true;
-      }
-      options.listen.emplace_back(value);
-      break;
-    case kRate:
-      ok = ParseNumber(value, 1, 100000, number);
-      options.ratePerSecond = static_cast<double>(number);
-      break;
-    case kBurst:
-      ok = ParseNumber(value, 1, 100000, number);
-      options.burst = static_cast<double>(number);
-      break;
-    case kMaxSessions:
-      ok = ParseNumber(value, 1, 10000, number);
-      options.maxSessions = static_cast<int>(number);
-      break;
-    case kMaxPerAddress:
-      ok = ParseNumber(value, 1, 10000, number);
-      options.maxSessionsPerAddress = static_cast<int>(number);
-      break;
-    case kMaxRequests:
-      ok = ParseNumber(value, 1, 100000, number);
-      options.maxRequestsPerSession = static_cast<int>(number);
-      break;
-    case kIdleTimeout:
-      ok = ParseNumber(value, 1, 600000, number);
-      options.idleTimeout = std::chrono::milliseconds(number);
-      break;
-    case kConnectTimeout:
-      ok = ParseNumber(value, 1, 60000, number);
-      timeouts.connect = std::chrono::milliseconds(number);
-      break;
-    case kAnswerTimeout:
-      ok = ParseNumber(value, 1, 60000, number);
-      timeouts.answer = std::chrono::milliseconds(number);
-      break;
-    default:
-      break;
-    }
-    if (!ok) {
+    if (!ApplyOption(got, value, line)) {
       std::fprintf(stderr, "zark-probed: bad value \"%s\" for --%s\n", optarg,
                    kOptions[index].name);
       return 2;
@@ -178,7 +197,19 @@ int main(int argc, char **argv) {
     PrintUsage(stderr);
     return 2;
   }
+  return std::nullopt;
+}
 
+void LogCounters(const ServerCounters &counters) {
+  LogLine("served " + std::to_string(counters.requests) + " request(s), " +
+          std::to_string(counters.checks) + " check(s), " +
+          std::to_string(counters.badRequests) + " bad, " +
+          std::to_string(counters.rateLimited) + " rate-limited, " +
+          std::to_string(counters.busy) + " busy");
+}
+
+// Runs the service until SIGINT or SIGTERM; returns the exit status.
+int RunService(const CommandLine &line) {
   // Blocked before any thread starts, so that every thread inherits the
   // mask and only sigwait below receives them.
   sigset_t stopSignals;
@@ -187,12 +218,12 @@ int main(int argc, char **argv) {
   sigaddset(&stopSignals, SIGTERM);
   pthread_sigmask(SIG_BLOCK, &stopSignals, nullptr);
 
-  SocketConnectBack connectBack(timeouts);
+  SocketConnectBack connectBack(line.timeouts);
   ProbeServer::Logger log;
-  if (!quiet) {
+  if (!line.quiet) {
     log = LogLine;
   }
-  ProbeServer server(options, connectBack, {}, log);
+  ProbeServer server(line.options, connectBack, {}, log);
   std::string error;
   if (!server.Start(error)) {
     LogLine("cannot start: " + error);
@@ -200,18 +231,23 @@ int main(int argc, char **argv) {
   }
   std::vector<uint16_t> ports = server.Ports();
   for (std::size_t i = 0; i < ports.size(); ++i) {
-    LogLine("listening on " + options.listen[i] + " (port " +
+    LogLine("listening on " + line.options.listen[i] + " (port " +
             std::to_string(ports[i]) + ")");
   }
   int received = 0;
   sigwait(&stopSignals, &received);
   LogLine(std::string("stopping on ") + strsignal(received));
   server.Stop();
-  ServerCounters counters = server.Counters();
-  LogLine("served " + std::to_string(counters.requests) + " request(s), " +
-          std::to_string(counters.checks) + " check(s), " +
-          std::to_string(counters.badRequests) + " bad, " +
-          std::to_string(counters.rateLimited) + " rate-limited, " +
-          std::to_string(counters.busy) + " busy");
+  LogCounters(server.Counters());
   return 0;
+}
+
+} // namespace
+
+int main(int argc, char **argv) {
+  CommandLine line;
+  if (std::optional<int> status = ParseCommandLine(argc, argv, line)) {
+    return *status;
+  }
+  return RunService(line);
 }

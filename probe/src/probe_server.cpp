@@ -302,112 +302,125 @@ bool ProbeServer::SendAll(int fd, std::string_view text) {
   return true;
 }
 
+void ProbeServer::Count(long ServerCounters::*counter) {
+  std::lock_guard<std::mutex> lock(mMutex);
+  ++(mCounters.*counter);
+}
+
+ProbeServer::LineRead ProbeServer::ReadRequestLine(int fd, std::string &pending,
+                                                   std::string &line) {
+  // One line, waiting at most idleTimeout for it.
+  const Clock::time_point deadline = Clock::now() + mOptions.idleTimeout;
+  std::size_t newline = pending.find('\n');
+  while (newline == std::string::npos) {
+    if (pending.size() >= kMaxRequestLine) {
+      return LineRead::kTooLong;
+    }
+    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+        deadline - Clock::now());
+    if (left.count() <= 0) {
+      return LineRead::kEnd;
+    }
+    pollfd watched[2] = {{fd, POLLIN, 0}, {mWakeFd.Get(), POLLIN, 0}};
+    int ready = ::poll(watched, 2, static_cast<int>(left.count()));
+    if (ready < 0 && errno != EINTR) {
+      return LineRead::kEnd;
+    }
+    if (watched[1].revents != 0) {
+      return LineRead::kEnd;
+    }
+    if (ready <= 0 || watched[0].revents == 0) {
+      continue;
+    }
+    char buffer[256];
+    // Never read past the longest line: what follows stays unread.
+    const std::size_t room = kMaxRequestLine - pending.size();
+    ssize_t n = ::recv(fd, buffer, std::min(room, sizeof(buffer)), 0);
+    if (n == 0) {
+      return LineRead::kEnd;
+    }
+    if (n < 0) {
+      if (errno == EAGAIN || errno == EINTR) {
+        continue;
+      }
+      return LineRead::kEnd;
+    }
+    std::size_t before = pending.size();
+    pending.append(buffer, static_cast<std::size_t>(n));
+    newline = pending.find('\n', before);
+  }
+  line = pending.substr(0, newline);
+  pending.erase(0, newline + 1);
+  return LineRead::kLine;
+}
+
+RateLimiter::Decision ProbeServer::TakeToken(const std::string &key,
+                                             Request::Kind kind) {
+  std::lock_guard<std::mutex> lock(mMutex);
+  RateLimiter::Decision decision = mLimiter.Take(key, Now());
+  if (!decision.allowed) {
+    if (decision.tooManyAddresses) {
+      ++mCounters.busy;
+    } else {
+      ++mCounters.rateLimited;
+    }
+  } else if (kind == Request::Kind::kCheck) {
+    ++mCounters.checks;
+  }
+  return decision;
+}
+
+std::string ProbeServer::AnswerRequest(const Request &request,
+                                       const sockaddr_storage &peer,
+                                       socklen_t peerLength,
+                                       const std::string &key) {
+  const RateLimiter::Decision decision = TakeToken(key, request.kind);
+  if (!decision.allowed) {
+    return decision.tooManyAddresses
+               ? FormatErrorAnswer(reason::kBusy)
+               : FormatErrorAnswer(reason::kRateLimited,
+                                   decision.retryAfter.count());
+  }
+  if (request.kind == Request::Kind::kAddress) {
+    return FormatAddressAnswer(key);
+  }
+  // The peer address of this very connection: the only place a check
+  // may go.
+  Verdict verdict = mConnectBack.Check(peer, peerLength, request);
+  Log(key + " " + TransportName(request.transport) + " " +
+      std::to_string(request.port) + ": " + ResultName(verdict.result) + " (" +
+      verdict.reason + ")");
+  return FormatCheckAnswer(request, verdict);
+}
+
 void ProbeServer::Serve(UniqueFd fd, sockaddr_storage peer,
                         socklen_t peerLength, const std::string &key) {
   std::string pending;
+  std::string line;
   for (int served = 0;; ++served) {
-    // One line, waiting at most idleTimeout for it.
-    const Clock::time_point deadline = Clock::now() + mOptions.idleTimeout;
-    std::size_t newline = pending.find('\n');
-    while (newline == std::string::npos) {
-      if (pending.size() >= kMaxRequestLine) {
-        {
-          std::lock_guard<std::mutex> lock(mMutex);
-          ++mCounters.badRequests;
-        }
-        (void)SendAll(fd.Get(), FormatErrorAnswer(reason::kLineTooLong));
-        return;
-      }
-      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-          deadline - Clock::now());
-      if (left.count() <= 0) {
-        return;
-      }
-      pollfd watched[2] = {{fd.Get(), POLLIN, 0}, {mWakeFd.Get(), POLLIN, 0}};
-      int ready = ::poll(watched, 2, static_cast<int>(left.count()));
-      if (ready < 0 && errno != EINTR) {
-        return;
-      }
-      if (watched[1].revents != 0) {
-        return;
-      }
-      if (ready <= 0 || watched[0].revents == 0) {
-        continue;
-      }
-      char buffer[256];
-      // Never read past the longest line: what follows stays unread.
-      const std::size_t room = kMaxRequestLine - pending.size();
-      ssize_t n = ::recv(fd.Get(), buffer, std::min(room, sizeof(buffer)), 0);
-      if (n == 0) {
-        return;
-      }
-      if (n < 0) {
-        if (errno == EAGAIN || errno == EINTR) {
-          continue;
-        }
-        return;
-      }
-      std::size_t before = pending.size();
-      pending.append(buffer, static_cast<std::size_t>(n));
-      std::size_t found = pending.find('\n', before);
-      newline = found;
+    const LineRead read = ReadRequestLine(fd.Get(), pending, line);
+    if (read == LineRead::kTooLong) {
+      Count(&ServerCounters::badRequests);
+      (void)SendAll(fd.Get(), FormatErrorAnswer(reason::kLineTooLong));
+      return;
     }
-    const std::string line = pending.substr(0, newline);
-    pending.erase(0, newline + 1);
-
-    {
-      std::lock_guard<std::mutex> lock(mMutex);
-      ++mCounters.requests;
+    if (read != LineRead::kLine) {
+      return;
     }
+    Count(&ServerCounters::requests);
     if (served >= mOptions.maxRequestsPerSession) {
-      {
-        std::lock_guard<std::mutex> lock(mMutex);
-        ++mCounters.busy;
-      }
+      Count(&ServerCounters::busy);
       (void)SendAll(fd.Get(), FormatErrorAnswer(reason::kBusy));
       return;
     }
     ParsedRequest parsed = ParseRequestLine(line);
     if (parsed.error != ParseError::kNone) {
-      {
-        std::lock_guard<std::mutex> lock(mMutex);
-        ++mCounters.badRequests;
-      }
+      Count(&ServerCounters::badRequests);
       (void)SendAll(fd.Get(), FormatBadRequestAnswer(parsed.error));
       return;
     }
-    RateLimiter::Decision decision;
-    {
-      std::lock_guard<std::mutex> lock(mMutex);
-      decision = mLimiter.Take(key, Now());
-      if (!decision.allowed) {
-        if (decision.tooManyAddresses) {
-          ++mCounters.busy;
-        } else {
-          ++mCounters.rateLimited;
-        }
-      } else if (parsed.request.kind == Request::Kind::kCheck) {
-        ++mCounters.checks;
-      }
-    }
-    std::string answer;
-    if (!decision.allowed) {
-      answer = decision.tooManyAddresses
-                   ? FormatErrorAnswer(reason::kBusy)
-                   : FormatErrorAnswer(reason::kRateLimited,
-                                       decision.retryAfter.count());
-    } else if (parsed.request.kind == Request::Kind::kAddress) {
-      answer = FormatAddressAnswer(key);
-    } else {
-      // The peer address of this very connection: the only place a check
-      // may go.
-      Verdict verdict = mConnectBack.Check(peer, peerLength, parsed.request);
-      answer = FormatCheckAnswer(parsed.request, verdict);
-      Log(key + " " + TransportName(parsed.request.transport) + " " +
-          std::to_string(parsed.request.port) + ": " +
-          ResultName(verdict.result) + " (" + verdict.reason + ")");
-    }
-    if (!SendAll(fd.Get(), answer)) {
+    if (!SendAll(fd.Get(),
+                 AnswerRequest(parsed.request, peer, peerLength, key))) {
       return;
     }
   }

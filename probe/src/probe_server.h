@@ -95,8 +95,29 @@ private:
 
   void AcceptLoop();
   void Accept(int listenFd);
+  // Answers the request lines of one connection until it closes, idles,
+  // breaks a limit or the server stops.
   void Serve(UniqueFd fd, sockaddr_storage peer, socklen_t peerLength,
              const std::string &key);
+  enum class LineRead {
+    kLine,    // line holds the next request line
+    kTooLong, // no newline within kMaxRequestLine bytes
+    kEnd,     // closed, idle past idleTimeout, failed, or Stop() was called
+  };
+  // Reads the next line of the connection fd, keeping what follows it in
+  // pending for the next call.
+  [[nodiscard]] LineRead ReadRequestLine(int fd, std::string &pending,
+                                         std::string &line);
+  // Takes a token of the key's bucket and counts the outcome.
+  [[nodiscard]] RateLimiter::Decision TakeToken(const std::string &key,
+                                                Request::Kind kind);
+  // The answer to one well-formed request: a refusal of the rate limiter,
+  // the peer's address, or the result of checking back on the peer.
+  [[nodiscard]] std::string AnswerRequest(const Request &request,
+                                          const sockaddr_storage &peer,
+                                          socklen_t peerLength,
+                                          const std::string &key);
+  void Count(long ServerCounters::*counter);
   void ReapSessions(bool all);
   // Sends all of text on the socket fd, waiting while it is full, until
   // mOptions.writeTimeout has passed. Unlike klibc::WriteAll it never raises

@@ -58,44 +58,64 @@ public:
       void *arg, DetectEnvironment &environment)
       : mRecord(record), mCallback(callback), mArg(arg), mEnv(environment) {}
 
+  // Runs the checks in order; 0 when all passed, -1 at the first that
+  // stopped the run (logged).
   int Execute() {
-    // 20: the interface.
+    if (!InterfaceStage() || !GatewayStage() || !WanStage()) {
+      return -1;
+    }
+    HopsStage();
+    if (!DnsStage() || !RouterStage()) {
+      return -1;
+    }
+    Begin(ZARK_DETECT_STAGE_DONE);
+    return 0;
+  }
+
+private:
+  // 20: the interface.
+  bool InterfaceStage() {
     Begin(ZARK_DETECT_STAGE_INTERFACE);
-    std::optional<std::string> routeTable = mEnv.network->RouteTable();
-    std::optional<std::vector<InterfaceInfo>> interfaces =
-        mEnv.network->Interfaces();
-    if (!interfaces) {
+    mRouteTable = mEnv.network->RouteTable();
+    mInterfaces = mEnv.network->Interfaces();
+    if (!mInterfaces) {
       return Stop("interface", "the network interfaces cannot be listed");
     }
-    const std::vector<DefaultRoute> routes =
-        routeTable ? ParseDefaultRoutes(*routeTable)
-                   : std::vector<DefaultRoute>{};
-    InterfaceCheck interface = CheckInterface(routes, *interfaces);
+    if (mRouteTable) {
+      mRoutes = ParseDefaultRoutes(*mRouteTable);
+    }
+    InterfaceCheck interface = CheckInterface(mRoutes, *mInterfaces);
     CopyTextZeroFilled(mRecord.network_interface, interface.interface);
     if (!interface.ok) {
       return Stop("interface", interface.why);
     }
     Passed("interface", interface.why);
+    return true;
+  }
 
-    // 30: the gateway.
+  // 30: the gateway.
+  bool GatewayStage() {
     Begin(ZARK_DETECT_STAGE_GATEWAY);
-    if (!routeTable) {
+    if (!mRouteTable) {
       return Stop("gateway", "the routing table cannot be read");
     }
-    GatewayCheck gateway = CheckGateway(routes, *interfaces);
+    GatewayCheck gateway = CheckGateway(mRoutes, *mInterfaces);
     if (!gateway.ok) {
       return Stop("gateway", gateway.why);
     }
-    const std::string gatewayText = FormatIpv4(gateway.gateway);
-    CopyTextZeroFilled(mRecord.gateway_ip, gatewayText);
+    mGatewayText = FormatIpv4(gateway.gateway);
+    CopyTextZeroFilled(mRecord.gateway_ip, mGatewayText);
     if (gateway.warning) {
       mRecord.warning |= ZARK_DETECT_WARN_GATEWAY;
       ZARK_DETECT_WARNING("detection: the gateway setting looks wrong: %s",
                           gateway.why.c_str());
     }
     Passed("gateway", gateway.why);
+    return true;
+  }
 
-    // 40: the WAN.
+  // 40: the WAN.
+  bool WanStage() {
     Begin(ZARK_DETECT_STAGE_WAN);
     const std::vector<WanProbeHost> hosts = ParseWanProbeHosts(
         mEnv.config(config_key::kWanProbeHosts, kDefaultWanProbeHosts));
@@ -113,20 +133,24 @@ public:
     if (!wan.ok) {
       return Stop("WAN", wan.why);
     }
+    mWanAddress = wan.reached.address;
     Passed("WAN", wan.why);
+    return true;
+  }
 
-    // 70: the hops to the first public address. Never stops the run.
+  // 70: the hops to the first public address. Never stops the run.
+  void HopsStage() {
     Begin(ZARK_DETECT_STAGE_HOPS);
     const std::vector<HopReply> replies =
-        mEnv.hopProber->Probe(wan.reached.address, mEnv.limits.hops);
+        mEnv.hopProber->Probe(mWanAddress, mEnv.limits.hops);
     HopsFinding hops = InterpretHops(replies, mEnv.limits.hops.maxTtl);
     if (!hops.known) {
       mRecord.hops = 0;
       mRecord.warning |= ZARK_DETECT_WARN_HOPS_UNKNOWN;
       ZARK_DETECT_WARNING("detection: the hop count towards %s is unknown: "
                           "%s (path %s)",
-                          FormatIpv4(wan.reached.address).c_str(),
-                          hops.why.c_str(), hops.path.c_str());
+                          FormatIpv4(mWanAddress).c_str(), hops.why.c_str(),
+                          hops.path.c_str());
     } else {
       mRecord.hops = hops.hops;
       if (hops.hops > 1) {
@@ -141,8 +165,10 @@ public:
       }
     }
     Passed("hops", hops.why + " (path " + hops.path + ")");
+  }
 
-    // 50: DNS.
+  // 50: DNS.
+  bool DnsStage() {
     Begin(ZARK_DETECT_STAGE_DNS);
     const std::string name =
         mEnv.config(config_key::kDnsProbeName, kDefaultDnsProbeName);
@@ -152,30 +178,17 @@ public:
       return Stop("DNS", dns.why);
     }
     Passed("DNS", dns.why);
+    return true;
+  }
 
-    // 80: the router.
+  // 80: the router.
+  bool RouterStage() {
     Begin(ZARK_DETECT_STAGE_ROUTER);
-    RouterFindings findings = ProbeRouter(*mEnv.router, gatewayText);
+    RouterFindings findings = ProbeRouter(*mEnv.router, mGatewayText);
     RouterCheck router = CheckRouter(findings);
-    mRecord.support_upnp = static_cast<int32_t>(router.upnp);
-    mRecord.support_natpmp = static_cast<int32_t>(router.natpmp);
-    CopyTextZeroFilled(mRecord.router_brand, router.name.brand);
-    CopyTextZeroFilled(mRecord.router_model, router.name.model);
-    CopyTextZeroFilled(mRecord.router_version, router.name.version);
-    CopyTextZeroFilled(mRecord.upnp_pfpath, router.name.pfpath);
-    CopyTextZeroFilled(mRecord.router_user_setting_name,
-                       mEnv.userSettingName(gatewayText));
-    mRecord.router_max_rule =
-        router.name.pfpath.empty() ? 0 : mEnv.maxRules(router.name);
+    RecordRouter(router);
     if (router.doubleNat) {
-      mRecord.warning |= kDetectWarnDoubleNat | ZARK_DETECT_WARN_HOPS_OVER_ONE;
-      ZARK_DETECT_WARNING(
-          "detection: double NAT: the router's outside address %s is %s; "
-          "ports it forwards are not reachable from the internet",
-          FormatIpv4(*router.outsideAddress).c_str(),
-          ClassifyIpv4(*router.outsideAddress) == Ipv4Class::kSharedCgn
-              ? "carrier-grade NAT space (100.64.0.0/10)"
-              : "a private address (RFC 1918)");
+      WarnDoubleNat(*router.outsideAddress);
     }
     if (!router.ok) {
       return Stop("router", router.why);
@@ -183,12 +196,34 @@ public:
     Passed("router", router.why + ", name \"" + router.name.pfpath +
                          "\", max rules " +
                          std::to_string(mRecord.router_max_rule));
-
-    Begin(ZARK_DETECT_STAGE_DONE);
-    return 0;
+    return true;
   }
 
-private:
+  // What the router check found, into the record (also when it failed).
+  void RecordRouter(const RouterCheck &router) {
+    mRecord.support_upnp = static_cast<int32_t>(router.upnp);
+    mRecord.support_natpmp = static_cast<int32_t>(router.natpmp);
+    CopyTextZeroFilled(mRecord.router_brand, router.name.brand);
+    CopyTextZeroFilled(mRecord.router_model, router.name.model);
+    CopyTextZeroFilled(mRecord.router_version, router.name.version);
+    CopyTextZeroFilled(mRecord.upnp_pfpath, router.name.pfpath);
+    CopyTextZeroFilled(mRecord.router_user_setting_name,
+                       mEnv.userSettingName(mGatewayText));
+    mRecord.router_max_rule =
+        router.name.pfpath.empty() ? 0 : mEnv.maxRules(router.name);
+  }
+
+  void WarnDoubleNat(uint32_t outsideAddress) {
+    mRecord.warning |= kDetectWarnDoubleNat | ZARK_DETECT_WARN_HOPS_OVER_ONE;
+    ZARK_DETECT_WARNING(
+        "detection: double NAT: the router's outside address %s is %s; "
+        "ports it forwards are not reachable from the internet",
+        FormatIpv4(outsideAddress).c_str(),
+        ClassifyIpv4(outsideAddress) == Ipv4Class::kSharedCgn
+            ? "carrier-grade NAT space (100.64.0.0/10)"
+            : "a private address (RFC 1918)");
+  }
+
   void Begin(int32_t stage) {
     mRecord.enProgress = stage;
     mStarted = mEnv.now();
@@ -208,11 +243,12 @@ private:
                      Elapsed(), why.c_str());
   }
 
-  int Stop(const char *check, const std::string &why) {
+  // Logs why the run stops at this check; always false.
+  bool Stop(const char *check, const std::string &why) {
     ZARK_PM_LOG_ERROR("detection stopped at the %s check (stage %d) after "
                       "%lld ms: %s",
                       check, mRecord.enProgress, Elapsed(), why.c_str());
-    return -1;
+    return false;
   }
 
   ZARK_ROUTER_DETECT_RESULT &mRecord;
@@ -220,6 +256,12 @@ private:
   void *mArg;
   DetectEnvironment &mEnv;
   Clock::time_point mStarted;
+  // What one check leaves for the later ones.
+  std::optional<std::string> mRouteTable;
+  std::optional<std::vector<InterfaceInfo>> mInterfaces;
+  std::vector<DefaultRoute> mRoutes;
+  std::string mGatewayText;
+  uint32_t mWanAddress = 0;
 };
 
 int32_t MaxRulesFromDatabase(const RouterName &name) {

@@ -27,101 +27,131 @@ std::string ErrnoText(int error) {
   return strerror_r(error, buffer, sizeof(buffer));
 }
 
+// One connection under way.
+struct Attempt {
+  Ipv4Endpoint endpoint;
+  UniqueFd fd;
+  bool pending = false;
+};
+
+enum class Started { kConnected, kPending, kFailed };
+
+// Opens a non-blocking socket in attempt.fd and starts connecting it to
+// attempt.endpoint; a failure is added to outcome.
+Started StartConnect(Attempt &attempt, ConnectOutcome &outcome) {
+  const Ipv4Endpoint &endpoint = attempt.endpoint;
+  attempt.fd = UniqueFd(
+      ::socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0));
+  if (!attempt.fd.Valid()) {
+    const int saved = errno;
+    ZARK_PM_LOG_CALL("socket", -1, saved);
+    outcome.failures.push_back(EndpointText(endpoint) + " " + ErrnoText(saved));
+    return Started::kFailed;
+  }
+  sockaddr_in target{};
+  target.sin_family = AF_INET;
+  target.sin_port = htons(endpoint.port);
+  target.sin_addr.s_addr = htonl(endpoint.address);
+  if (::connect(attempt.fd.Get(), reinterpret_cast<sockaddr *>(&target),
+                sizeof(target)) == 0) {
+    return Started::kConnected;
+  }
+  if (errno != EINPROGRESS) {
+    outcome.failures.push_back(EndpointText(endpoint) + " " + ErrnoText(errno));
+    return Started::kFailed;
+  }
+  attempt.pending = true;
+  return Started::kPending;
+}
+
+// The attempt's socket became writable: true when it connected; otherwise
+// its error is added to outcome.
+bool FinishConnect(Attempt &attempt, ConnectOutcome &outcome) {
+  attempt.pending = false;
+  int error = 0;
+  socklen_t length = sizeof(error);
+  if (::getsockopt(attempt.fd.Get(), SOL_SOCKET, SO_ERROR, &error, &length) !=
+      0) {
+    error = errno;
+  }
+  if (error == 0) {
+    return true;
+  }
+  outcome.failures.push_back(EndpointText(attempt.endpoint) + " " +
+                             ErrnoText(error));
+  return false;
+}
+
+// Waits until deadline for the first pending attempt to connect and sets
+// outcome.reached to it; every attempt that fails or is still pending at
+// the deadline is added to outcome.failures.
+void AwaitFirstConnect(std::vector<Attempt> &attempts,
+                       Clock::time_point deadline,
+                       std::chrono::milliseconds budget,
+                       ConnectOutcome &outcome) {
+  for (;;) {
+    std::vector<pollfd> watched;
+    std::vector<Attempt *> owners;
+    for (Attempt &attempt : attempts) {
+      if (attempt.pending) {
+        watched.push_back({attempt.fd.Get(), POLLOUT, 0});
+        owners.push_back(&attempt);
+      }
+    }
+    if (watched.empty()) {
+      return;
+    }
+    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+        deadline - Clock::now());
+    if (left.count() <= 0) {
+      for (const Attempt *attempt : owners) {
+        outcome.failures.push_back(EndpointText(attempt->endpoint) +
+                                   " no answer within " +
+                                   std::to_string(budget.count()) + " ms");
+      }
+      return;
+    }
+    const int ready = ::poll(watched.data(), watched.size(),
+                             static_cast<int>(left.count()) + 1);
+    if (ready < 0) {
+      if (errno == EINTR) {
+        continue;
+      }
+      ZARK_PM_LOG_CALL("poll", ready, errno, "(WAN probe)");
+      outcome.failures.push_back("poll failed");
+      return;
+    }
+    for (std::size_t i = 0; i < watched.size(); ++i) {
+      if (watched[i].revents != 0 && FinishConnect(*owners[i], outcome)) {
+        outcome.reached = owners[i]->endpoint;
+        return;
+      }
+    }
+  }
+}
+
 class SystemTcpConnector final : public TcpConnector {
 public:
   ConnectOutcome ConnectAny(std::span<const Ipv4Endpoint> endpoints,
                             std::chrono::milliseconds budget) override {
     ConnectOutcome outcome;
     const Clock::time_point deadline = Clock::now() + budget;
-    struct Attempt {
-      Ipv4Endpoint endpoint;
-      UniqueFd fd;
-      bool pending = false;
-    };
     std::vector<Attempt> attempts;
     for (const Ipv4Endpoint &endpoint : endpoints) {
-      Attempt attempt{
-          endpoint,
-          UniqueFd(
-              ::socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0)),
-          false};
-      if (!attempt.fd.Valid()) {
-        const int saved = errno;
-        ZARK_PM_LOG_CALL("socket", -1, saved);
-        outcome.failures.push_back(EndpointText(endpoint) + " " +
-                                   ErrnoText(saved));
-        continue;
-      }
-      sockaddr_in target{};
-      target.sin_family = AF_INET;
-      target.sin_port = htons(endpoint.port);
-      target.sin_addr.s_addr = htonl(endpoint.address);
-      if (::connect(attempt.fd.Get(), reinterpret_cast<sockaddr *>(&target),
-                    sizeof(target)) == 0) {
+      Attempt attempt{endpoint, UniqueFd(), false};
+      switch (StartConnect(attempt, outcome)) {
+      case Started::kConnected:
         outcome.reached = endpoint;
         return outcome;
-      }
-      if (errno != EINPROGRESS) {
-        outcome.failures.push_back(EndpointText(endpoint) + " " +
-                                   ErrnoText(errno));
-        continue;
-      }
-      attempt.pending = true;
-      attempts.push_back(std::move(attempt));
-    }
-
-    for (;;) {
-      std::vector<pollfd> watched;
-      std::vector<Attempt *> owners;
-      for (Attempt &attempt : attempts) {
-        if (attempt.pending) {
-          watched.push_back({attempt.fd.Get(), POLLOUT, 0});
-          owners.push_back(&attempt);
-        }
-      }
-      if (watched.empty()) {
-        return outcome;
-      }
-      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-          deadline - Clock::now());
-      if (left.count() <= 0) {
-        for (const Attempt *attempt : owners) {
-          outcome.failures.push_back(EndpointText(attempt->endpoint) +
-                                     " no answer within " +
-                                     std::to_string(budget.count()) + " ms");
-        }
-        return outcome;
-      }
-      const int ready = ::poll(watched.data(), watched.size(),
-                               static_cast<int>(left.count()) + 1);
-      if (ready < 0) {
-        if (errno == EINTR) {
-          continue;
-        }
-        ZARK_PM_LOG_CALL("poll", ready, errno, "(WAN probe)");
-        outcome.failures.push_back("poll failed");
-        return outcome;
-      }
-      for (std::size_t i = 0; i < watched.size(); ++i) {
-        if (watched[i].revents == 0) {
-          continue;
-        }
-        Attempt &attempt = *owners[i];
-        attempt.pending = false;
-        int error = 0;
-        socklen_t length = sizeof(error);
-        if (::getsockopt(attempt.fd.Get(), SOL_SOCKET, SO_ERROR, &error,
-                         &length) != 0) {
-          error = errno;
-        }
-        if (error == 0) {
-          outcome.reached = attempt.endpoint;
-          return outcome;
-        }
-        outcome.failures.push_back(EndpointText(attempt.endpoint) + " " +
-                                   ErrnoText(error));
+      case Started::kPending:
+        attempts.push_back(std::move(attempt));
+        break;
+      case Started::kFailed:
+        break;
       }
     }
+    AwaitFirstConnect(attempts, deadline, budget, outcome);
+    return outcome;
   }
 };
 
