@@ -1,4 +1,5 @@
 // Picking the default gateway out of /proc/net/route texts.
+#include "base/local_network.h"
 #include "base/route_table.h"
 #include "libzarkportmap.h"
 
@@ -23,7 +24,7 @@ const std::string kTitle = "Iface\tDestination\tGateway \tFlags\tRefCnt\tUse\t"
 
 std::string Gateway(const std::string &table) {
   auto gateway = ParseDefaultGateway(table);
-  return gateway ? FormatIPv4(*gateway) : "none";
+  return gateway ? FormatIpv4(ntohl(*gateway)) : "none";
 }
 
 TEST(PortMapGatewayRoute, OneDefaultRoute) {
@@ -113,7 +114,7 @@ TEST(PortMapGatewayRoute, GetGatewayIPMatchesTheMachinesTable) {
   int rc = KLibGetGatewayIP(buf, sizeof(buf));
   if (expected) {
     EXPECT_EQ(0, rc);
-    EXPECT_EQ(FormatIPv4(*expected), buf);
+    EXPECT_EQ(FormatIpv4(ntohl(*expected)), buf);
   } else {
     EXPECT_EQ(-1, rc);
     EXPECT_TRUE(zark::test::HasLogContaining("no default IPv4 route"));

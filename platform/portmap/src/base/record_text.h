@@ -27,6 +27,14 @@ void CopyText(char (&field)[N], std::string_view text) {
   field[length] = '\0';
 }
 
+// CopyText into a field cleared first: no byte of an earlier value stays
+// after the NUL (records handed out whole and compared byte for byte).
+template <std::size_t N>
+void CopyTextZeroFilled(char (&field)[N], std::string_view text) {
+  std::memset(field, 0, N);
+  CopyText(field, text);
+}
+
 } // namespace zark::portmap
 
 #endif

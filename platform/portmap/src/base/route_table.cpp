@@ -3,6 +3,7 @@
 #include "libzarkportmap.h"
 
 #include "base/conf_file.h"
+#include "base/local_network.h"
 #include "base/portmap_log.h"
 
 #include <arpa/inet.h>
@@ -109,16 +110,6 @@ std::optional<uint32_t> ParseDefaultGateway(std::string_view routeTable) {
   return htonl(routes.front().gateway);
 }
 
-std::string FormatIPv4(uint32_t networkOrder) {
-  char text[INET_ADDRSTRLEN] = {};
-  in_addr address{};
-  address.s_addr = networkOrder;
-  if (::inet_ntop(AF_INET, &address, text, sizeof(text)) == nullptr) {
-    return {};
-  }
-  return text;
-}
-
 } // namespace zark::portmap
 
 extern "C" int KLibGetGatewayIP(char *buf, int size) {
@@ -138,7 +129,7 @@ extern "C" int KLibGetGatewayIP(char *buf, int size) {
       ZARK_PM_LOG_ERROR("KLibGetGatewayIP: no default IPv4 route");
       return -1;
     }
-    std::string text = FormatIPv4(*gateway);
+    std::string text = FormatIpv4(ntohl(*gateway));
     if (text.empty() || text.size() >= static_cast<std::size_t>(size)) {
       ZARK_PM_LOG_ERROR("KLibGetGatewayIP: buffer of %d bytes too small", size);
       return -1;

@@ -43,9 +43,6 @@ ParseDefaultRoutes(std::string_view routeTable);
 [[nodiscard]] std::optional<uint32_t>
 ParseDefaultGateway(std::string_view routeTable);
 
-// Dotted-quad text of an address in network byte order.
-[[nodiscard]] std::string FormatIPv4(uint32_t networkOrder);
-
 } // namespace zark::portmap
 
 #endif

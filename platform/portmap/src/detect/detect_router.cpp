@@ -32,13 +32,6 @@ constexpr std::size_t kMaxResolvConfBytes = 64 * 1024;
 std::mutex gFactoryMutex;
 std::function<DetectEnvironment()> gFactory;
 
-// CopyText into a field cleared first, so no byte of an earlier value stays.
-void CopyTextZeroFilled(char (&field)[ZARK_PORTMAP_TEXT_SIZE],
-                        std::string_view text) {
-  std::memset(field, 0, sizeof(field));
-  CopyText(field, text);
-}
-
 std::string NameOf(std::string_view brand, std::string_view model,
                    std::string_view version) {
   if (brand.empty() || model.empty()) {
