@@ -16,7 +16,7 @@
 
 namespace {
 
-using zark::portmap::FormatIPv4;
+using zark::portmap::FormatIpv4;
 using zark::portmap::ParseDefaultGateway;
 
 const std::string kTitle = "Iface\tDestination\tGateway \tFlags\tRefCnt\tUse\t"
