@@ -1,7 +1,7 @@
 // Fuzz target of the NAT-PMP driver (natpmp.cpp over libnatpmp), with the
 // fuzzer playing the router: every datagram that answers a request comes
-// from the input, sent from 127.0.0.1 by a scripted responder
-// (scripted_router.h) inside a private network namespace.
+// from the input, sent from 127.0.0.1 by the tests' fake router
+// (fake_natpmp.h) playing a script, inside a private network namespace.
 //
 // Input: pieces separated by kPieceSeparator.
 //   piece 0: the job, up to eight operations of three bytes: kind (add,
@@ -20,22 +20,24 @@
 // - reading or listing the table answers kUnsupported without a request.
 #include "base/local_network.h"
 #include "drivers/natpmp.h"
+#include "fake_natpmp.h"
 #include "fuzz_support.h"
-#include "scripted_router.h"
 #include "syslog_capture.h"
 
 #include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <initializer_list>
+#include <optional>
 #include <string>
+#include <vector>
 
 namespace {
 
 using zark::fuzz::Require;
 using namespace zark::portmap;
 
-zark::fuzz::ScriptedUdpRouter *gRouter = nullptr;
+zark::test::FakeNatPmp *gRouter = nullptr;
 
 bool OneOf(RouterOutcome outcome, std::initializer_list<RouterOutcome> set) {
   for (RouterOutcome allowed : set) {
@@ -57,7 +59,17 @@ void RequireOutcome(const char *operation, const RouterResult &result,
 
 extern "C" int LLVMFuzzerInitialize(int *, char ***) {
   zark::fuzz::EnterPrivateNetworkOrDie();
-  static zark::fuzz::ScriptedUdpRouter router;
+  static zark::test::FakeNatPmp router;
+  // Once an input's datagrams are used up, every request is refused:
+  // version 0, opcode 128 + the request's, result 2 (not authorized), the
+  // seconds since the start of epoch; a mapping reply's ports and lifetime
+  // stay 0.
+  router.SetHandler([](const zark::test::NatPmpRequest &request) {
+    std::vector<uint8_t> refusal = {
+        0, static_cast<uint8_t>(128 + request.opcode), 0, 2, 0, 0, 0, 1};
+    refusal.resize(request.opcode == 0 ? 12 : 16, 0);
+    return std::optional<std::vector<uint8_t>>(std::move(refusal));
+  });
   gRouter = &router;
   return 0;
 }
@@ -66,10 +78,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   zark::test::ClearLogs();
   const std::vector<std::string_view> pieces =
       zark::fuzz::SplitPieces(zark::fuzz::AsText(data, size));
-  std::vector<std::string> replies;
+  std::vector<std::vector<uint8_t>> replies;
   for (std::size_t i = 1; i < pieces.size(); ++i) {
-    replies.emplace_back(pieces[i]);
+    replies.emplace_back(pieces[i].begin(), pieces[i].end());
   }
+  gRouter->ResetRequests();
   gRouter->Script(std::move(replies));
 
   NatPmpOptions options;
@@ -130,20 +143,20 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
       break;
     }
     case 3: {
-      const std::size_t before = gRouter->Seen().size();
+      const int before = gRouter->Requests();
       RouterMapping entry;
       Require(router.GetSpecificPortMapping(mapping.protocol, port, entry)
                           .outcome == RouterOutcome::kUnsupported &&
-                  gRouter->Seen().size() == before,
+                  gRouter->Requests() == before,
               "NAT-PMP read a mapping");
       break;
     }
     default: {
-      const std::size_t before = gRouter->Seen().size();
+      const int before = gRouter->Requests();
       std::vector<RouterMapping> entries;
       Require(router.ListMappings(entries).outcome ==
                       RouterOutcome::kUnsupported &&
-                  entries.empty() && gRouter->Seen().size() == before,
+                  entries.empty() && gRouter->Requests() == before,
               "NAT-PMP listed mappings");
       break;
     }

@@ -1,8 +1,8 @@
 // Fuzz target of the UPnP IGD driver (upnp.cpp over miniupnpc), with the
 // fuzzer playing the router: its root description and every SOAP reply or
-// fault come from the input, served over HTTP on 127.0.0.1 by a scripted
-// router (scripted_router.h) inside a private network namespace, so that
-// whatever a reply names, nothing else can be reached.
+// fault come from the input, served over HTTP on 127.0.0.1 by the tests'
+// fake router (fake_igd.h) playing a script, inside a private network
+// namespace, so that whatever a reply names, nothing else can be reached.
 //
 // Input: pieces separated by kPieceSeparator.
 //   piece 0: the job. Byte 0 bit 0 chooses the first lease kind; then up
@@ -26,12 +26,13 @@
 // - a mapping or address answered kOk is well-formed (dotted quad, port).
 #include "base/local_network.h"
 #include "drivers/upnp.h"
+#include "fake_igd.h"
 #include "fuzz_support.h"
-#include "scripted_router.h"
 #include "syslog_capture.h"
 
 #include <cstddef>
 #include <cstdint>
+#include <cstdlib>
 #include <initializer_list>
 #include <memory>
 #include <string>
@@ -41,7 +42,7 @@ namespace {
 using zark::fuzz::Require;
 using namespace zark::portmap;
 
-zark::fuzz::ScriptedHttpRouter *gRouter = nullptr;
+zark::test::FakeIgd *gRouter = nullptr;
 
 const std::vector<Ipv4Network> kLan = {{0xc0a84d00u, 0xffffff00u}};
 constexpr uint32_t kGateway = 0x7f000001u;
@@ -115,11 +116,11 @@ bool LocalUrl(const std::string &url) {
 // the body names the action. Counted by the body's action here until the
 // driver accepts the standard service types only; then look at soapAction
 // alone.
-int Find(const std::vector<zark::fuzz::HttpRequestSeen> &seen,
-         const char *action, std::size_t from) {
+int Find(const std::vector<zark::test::SoapRequest> &seen, const char *action,
+         std::size_t from) {
   for (std::size_t i = from; i < seen.size(); ++i) {
-    if (seen[i].soapAction == action ||
-        (seen[i].soapAction.empty() && seen[i].bodyAction == action)) {
+    if (seen[i].action == action ||
+        (seen[i].action.empty() && seen[i].bodyAction == action)) {
       return static_cast<int>(i);
     }
   }
@@ -131,7 +132,17 @@ int Find(const std::vector<zark::fuzz::HttpRequestSeen> &seen,
 extern "C" int LLVMFuzzerInitialize(int *, char ***) {
   zark::fuzz::EnterPrivateNetworkOrDie();
   // Lives for the whole process: its thread serves every input.
-  static zark::fuzz::ScriptedHttpRouter router;
+  static zark::test::FakeIgd router;
+  if (!router.Ok()) {
+    std::abort();
+  }
+  // Once an input's replies are used up, every request's connection is
+  // closed without a byte.
+  router.OnGet(
+      [](const std::string &) { return zark::test::HttpReply{.close = true}; });
+  router.OnAnyAction([](const zark::test::SoapRequest &) {
+    return zark::test::HttpReply{.close = true};
+  });
   gRouter = &router;
   return 0;
 }
@@ -140,10 +151,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   zark::test::ClearLogs();
   const std::vector<std::string_view> pieces =
       zark::fuzz::SplitPieces(zark::fuzz::AsText(data, size));
-  std::vector<std::string> replies;
+  std::vector<zark::test::HttpReply> replies;
   for (std::size_t i = 1; i < pieces.size(); ++i) {
-    replies.push_back(Framed(pieces[i]));
+    replies.push_back(zark::test::HttpReply{.raw = Framed(pieces[i])});
   }
+  gRouter->ResetCounts();
   gRouter->Script(std::move(replies));
 
   zark::fuzz::InputReader job(pieces.empty() ? std::string_view() : pieces[0]);
@@ -172,7 +184,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     const uint16_t port = job.Uint16();
     const IpProtocol protocol =
         (port & 1) != 0 ? IpProtocol::kUdp : IpProtocol::kTcp;
-    const std::size_t before = gRouter->Seen().size();
+    const std::size_t before = gRouter->SoapRequests().size();
     switch (kind) {
     case 0: {
       PortMapping mapping;
@@ -188,7 +200,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
                       RouterOutcome::kNoAnswer, RouterOutcome::kBadReply,
                       RouterOutcome::kNoRouter, RouterOutcome::kFailed});
       if (added.Ok()) {
-        const std::vector<zark::fuzz::HttpRequestSeen> seen = gRouter->Seen();
+        const std::vector<zark::test::SoapRequest> seen =
+            gRouter->SoapRequests();
         const int add = Find(seen, "AddPortMapping", before);
         Require(add >= 0 && Find(seen, "GetSpecificPortMappingEntry",
                                  static_cast<std::size_t>(add) + 1) >= 0,

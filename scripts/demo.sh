@@ -58,12 +58,13 @@ name="zd$$"
 echo "== test network $name"
 tn_up "$name"
 tn_start_dns
-probe="none (no zark-probed in $tn_build/bin): the reachability test has no outside service"
-if tn_have_probe; then
-  tn_start_probe
-  tn_configure_probe
-  probe="zark-probed on $TN_WAN_OUTSIDE:$TN_PROBE_PORT (log: $tn_logs/probe.log)"
-fi
+tn_have_probe || {
+  echo "demo: $tn_build/bin/zark-probed is not built" >&2
+  exit 1
+}
+tn_start_probe
+tn_configure_probe
+probe="zark-probed on $TN_WAN_OUTSIDE:$TN_PROBE_PORT (log: $tn_logs/probe.log)"
 tn_start_host
 tn_start_relay "$address" "$port"
 

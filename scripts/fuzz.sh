@@ -10,7 +10,7 @@
 # mount and network namespaces.
 #
 # Environment:
-#   FUZZ_SECONDS   seconds per target (default 15; 20 targets, two at a
+#   FUZZ_SECONDS   seconds per target (default 15; 21 targets, two at a
 #                  time: about 2.5 minutes of fuzzing)
 #   FUZZ_JOBS      targets run at once (default 2)
 #   FUZZ_TARGETS   space-separated subset of target names (default all)
@@ -30,31 +30,15 @@ unit_timeout=${FUZZ_UNIT_TIMEOUT:-25}
 # clang with its sanitizer and libFuzzer runtimes, clang-tidy, cppcheck.
 "$root/scripts/install-deps.sh" --hardening
 
-# Targets: name, binary, seed corpus. The ones under fuzz/ first, then the
-# ones that live beside their test suites.
+# Targets: one per seed corpus fuzz/corpus/<name>/, built as Fuzz<name>.
 names=()
-declare -A binary seeds
 for folder in "$root"/fuzz/corpus/*/; do
-  name=$(basename "$folder")
-  names+=("$name")
-  binary[$name]=Fuzz$name
-  seeds[$name]=$folder
-done
-for entry in KlibcKeyValueParser:KlibcKeyValueParserFuzzer:tests/klibc/corpus \
-             FirewallServiceFile:FirewallServiceFileFuzzer:tests/firewall/corpus \
-             PortMapRouterParsers:PortMapRouterParsersFuzzer:tests/portmap_router/corpus \
-             PortTestProbeAnswer:PortTestProbeAnswerFuzzer:tests/porttest/corpus; do
-  IFS=: read -r name bin corpus <<<"$entry"
-  if [ -d "$root/$corpus" ]; then
-    names+=("$name")
-    binary[$name]=$bin
-    seeds[$name]=$root/$corpus
-  fi
+  names+=("$(basename "$folder")")
 done
 if [ -n "${FUZZ_TARGETS:-}" ]; then
   read -r -a names <<<"$FUZZ_TARGETS"
   for name in "${names[@]}"; do
-    if [ -z "${binary[$name]:-}" ]; then
+    if ! [ -d "$root/fuzz/corpus/$name" ]; then
       echo "unknown fuzz target $name" >&2
       exit 2
     fi
@@ -69,11 +53,7 @@ CC=clang CXX=clang++ cmake -S "$root" -B "$build" \
   "-DCMAKE_C_FLAGS=-fsanitize=fuzzer-no-link" \
   "-DCMAKE_CXX_FLAGS=-fsanitize=fuzzer-no-link" \
   -DZARK_SANITIZE=address,undefined -DZARK_BUILD_BENCH=OFF >/dev/null
-build_targets=()
-for name in "${names[@]}"; do
-  build_targets+=("${binary[$name]}")
-done
-cmake --build "$build" -j "$jobs" --target "${build_targets[@]}"
+cmake --build "$build" -j "$jobs" --target "${names[@]/#/Fuzz}"
 
 run_dir=$build/fuzz-run
 mkdir -p "$run_dir"
@@ -91,9 +71,10 @@ run_target() {
   ASAN_OPTIONS=detect_leaks=1:allocator_may_return_null=1 \
   UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1 \
     timeout --kill-after=30 $((seconds + 180)) \
-    "$build/bin/${binary[$name]}" -max_total_time="$seconds" \
+    "$build/bin/Fuzz$name" -max_total_time="$seconds" \
       -timeout="$unit_timeout" -rss_limit_mb=2560 -print_final_stats=1 \
-      -artifact_prefix="$dir/artifacts/" "$dir/corpus" "${seeds[$name]}" \
+      -artifact_prefix="$dir/artifacts/" "$dir/corpus" \
+      "$root/fuzz/corpus/$name" \
       >"$dir/log" 2>&1 || status=$?
   local executions corpus crashes
   executions=$(sed -n 's/^stat::number_of_executed_units: *//p' "$dir/log" |
@@ -156,7 +137,7 @@ if [ ${#failed[@]} -gt 0 ]; then
     ls -1 "$root/fuzz/crashes/$name/"
     echo "--- last lines of $run_dir/$name/log:"
     tail -40 "$run_dir/$name/log"
-    echo "--- reproduce with: $build/bin/${binary[$name]} <input>"
+    echo "--- reproduce with: $build/bin/Fuzz$name <input>"
   done
   exit 1
 fi

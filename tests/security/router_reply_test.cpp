@@ -22,9 +22,9 @@
 #include "db_test_support.h"
 #include "detect/router_probe.h"
 #include "drivers/driver_choice.h"
+#include "fake_igd.h"
 #include "hermetic.h"
 #include "libzarkportmap.h"
-#include "scripted_igd.h"
 #include "security_support.h"
 #include "syslog_capture.h"
 #include "test_network.h"
@@ -63,7 +63,8 @@ protected:
     mOutside = std::make_unique<CountingListener>(BoundSocketInNamespace(
         mNet.outsideNs, SOCK_STREAM, mNet.wanOutside, 0));
     ASSERT_TRUE(mOutside->Ok());
-    mIgd = std::make_unique<ScriptedIgd>(mNet.lanServer);
+    mIgd = std::make_unique<zark::test::FakeIgd>(zark::test::IgdVariant::kIpV1,
+                                                 mNet.lanServer);
     ASSERT_TRUE(mIgd->Ok());
   }
 
@@ -133,15 +134,12 @@ protected:
 
   zark::testnet::TestNetwork mNet;
   std::unique_ptr<CountingListener> mOutside;
-  std::unique_ptr<ScriptedIgd> mIgd;
+  std::unique_ptr<zark::test::FakeIgd> mIgd;
 };
 
 TEST_F(SecurityRouterReplies, UrlBaseOffTheNetworkIsRefusedBeforeAnyRequest) {
   Configure("yes", "no");
-  const std::string description = IgdDescription(Elsewhere("/"), "/ctl/IPConn");
-  mIgd->OnGet([description](const std::string &) {
-    return IgdReply{200, description, ""};
-  });
+  mIgd->SetUrlBase(Elsewhere("/"));
   UseScriptedDevice();
 
   ZARK_ROUTER_SAVE_RULE_RESULT result;
@@ -154,7 +152,8 @@ TEST_F(SecurityRouterReplies, UrlBaseOffTheNetworkIsRefusedBeforeAnyRequest) {
       "refusing control URL " + Elsewhere("/ctl/IPConn") +
       " of the UPnP device at " + mIgd->Url("/rootDesc.xml") + ": host " +
       mNet.wanOutside + " is not on the local network"));
-  EXPECT_EQ(std::vector<std::string>{"GET /rootDesc.xml"}, mIgd->Requests());
+  EXPECT_EQ(std::vector<std::string>{"GET /rootDesc.xml"},
+            mIgd->RequestLines());
   EXPECT_FALSE(std::filesystem::exists(ZARK_PORTMAP_RULE_CONF));
   ExpectNothingWentElsewhere();
 }
@@ -167,15 +166,12 @@ TEST_F(SecurityRouterReplies, UrlBaseWithUserInfoGoesWhereTheCheckLooked) {
   const std::string urlBase =
       "http://" + mNet.lanServer + ":" + std::to_string(mIgd->Port()) + "@" +
       mNet.wanOutside + ":" + std::to_string(mOutside->Port()) + "/";
-  const std::string description = IgdDescription(urlBase, "/ctl/IPConn");
-  mIgd->OnGet([description](const std::string &) {
-    return IgdReply{200, description, ""};
-  });
+  mIgd->SetUrlBase(urlBase);
   UseScriptedDevice();
 
   ZARK_ROUTER_SAVE_RULE_RESULT result;
   EXPECT_EQ(0, Save(result)) << result.errType << " " << result.detail.text;
-  const std::vector<std::string> requests = mIgd->Requests();
+  const std::vector<std::string> requests = mIgd->RequestLines();
   EXPECT_NE(requests.end(),
             std::find(requests.begin(), requests.end(), "SOAP AddPortMapping"));
   ExpectNothingWentElsewhere();
@@ -185,7 +181,7 @@ TEST_F(SecurityRouterReplies, RedirectOfTheDescriptionIsNotFollowed) {
   Configure("yes", "no");
   const std::string target = Elsewhere("/rootDesc.xml");
   mIgd->OnGet([target](const std::string &) {
-    return IgdReply{302, "", target};
+    return zark::test::HttpReply{302, "", target};
   });
   UseScriptedDevice();
 
@@ -199,7 +195,7 @@ TEST_F(SecurityRouterReplies, RedirectOfTheDescriptionIsNotFollowed) {
           result.detail.text,
           ("no UPnP description at " + mIgd->Url("/rootDesc.xml")).c_str()))
       << result.detail.text;
-  for (const std::string &request : mIgd->Requests()) {
+  for (const std::string &request : mIgd->RequestLines()) {
     EXPECT_EQ("GET /rootDesc.xml", request);
   }
   EXPECT_FALSE(std::filesystem::exists(ZARK_PORTMAP_RULE_CONF));
@@ -208,11 +204,10 @@ TEST_F(SecurityRouterReplies, RedirectOfTheDescriptionIsNotFollowed) {
 
 TEST_F(SecurityRouterReplies, RedirectOfASoapRequestIsNotFollowed) {
   Configure("yes", "no");
-  const std::string description = IgdDescription("", "/ctl/IPConn");
-  mIgd->OnGet([description](const std::string &) {
-    return IgdReply{200, description, ""};
+  const std::string target = Elsewhere("/ctl/IPConn");
+  mIgd->OnAnyAction([target](const zark::test::SoapRequest &) {
+    return zark::test::HttpReply{307, "", target};
   });
-  mIgd->ReplyToEverySoapAction({307, "", Elsewhere("/ctl/IPConn")});
   UseScriptedDevice();
 
   ZARK_ROUTER_SAVE_RULE_RESULT result;
@@ -222,7 +217,7 @@ TEST_F(SecurityRouterReplies, RedirectOfASoapRequestIsNotFollowed) {
   EXPECT_NE(nullptr,
             std::strstr(result.detail.text, "UPNP_AddPortMapping TCP 18080->"))
       << result.detail.text;
-  const std::vector<std::string> requests = mIgd->Requests();
+  const std::vector<std::string> requests = mIgd->RequestLines();
   EXPECT_NE(requests.end(),
             std::find(requests.begin(), requests.end(), "SOAP AddPortMapping"));
   EXPECT_FALSE(std::filesystem::exists(ZARK_PORTMAP_RULE_CONF));
@@ -380,10 +375,7 @@ private:
 };
 
 TEST_F(SecurityRouterReplies, DetectionRefusesSsdpAnswersPointingElsewhere) {
-  const std::string description = IgdDescription(Elsewhere("/"), "/ctl/IPConn");
-  mIgd->OnGet([description](const std::string &) {
-    return IgdReply{200, description, ""};
-  });
+  mIgd->SetUrlBase(Elsewhere("/"));
   SsdpResponder device(
       mNet.lanServer, {Elsewhere("/rootDesc.xml"), mIgd->Url("/rootDesc.xml")});
   ASSERT_TRUE(device.Ok());
@@ -403,7 +395,8 @@ TEST_F(SecurityRouterReplies, DetectionRefusesSsdpAnswersPointingElsewhere) {
                                Elsewhere("/rootDesc.xml")));
   EXPECT_TRUE(
       HasLogContaining("refusing control URL " + Elsewhere("/ctl/IPConn")));
-  EXPECT_EQ(std::vector<std::string>{"GET /rootDesc.xml"}, mIgd->Requests());
+  EXPECT_EQ(std::vector<std::string>{"GET /rootDesc.xml"},
+            mIgd->RequestLines());
   // The real router still answers NAT-PMP: the probe ran against it.
   EXPECT_EQ(zark::portmap::ProtocolSupport::kYes, findings.natpmp.support)
       << findings.natpmp.why;

@@ -1,10 +1,11 @@
-// A fake NAT-PMP router (RFC 6886) on 127.0.0.1 for unit tests: a UDP
-// responder on a thread of its own that keeps a mapping table like a
-// router (mapping, unmapping with lifetime 0, another public port when the
-// asked one is taken) or answers from a handler a test installs. It can be
-// told to stay silent. Every request is counted.
-#ifndef ZARK_TESTS_PORTMAP_ROUTER_FAKE_NATPMP_H
-#define ZARK_TESTS_PORTMAP_ROUTER_FAKE_NATPMP_H
+// A fake NAT-PMP router (RFC 6886) on 127.0.0.1 for unit tests and the fuzz
+// targets: a UDP responder on a thread of its own that keeps a mapping
+// table like a router (mapping, unmapping with lifetime 0, another public
+// port when the asked one is taken), or answers from a handler a test
+// installs, or from a script of datagrams. It can be told to stay silent.
+// Every request is counted.
+#ifndef ZARK_TESTS_PORTMAP_SUPPORT_FAKE_NATPMP_H
+#define ZARK_TESTS_PORTMAP_SUPPORT_FAKE_NATPMP_H
 
 #include <cstdint>
 #include <functional>
@@ -43,6 +44,10 @@ public:
 
   uint16_t Port() const { return mPort; }
   void SetHandler(Handler handler);
+  // The next requests are answered with these datagrams in order (an empty
+  // one sends nothing), before the handler; then the handler and the
+  // built-in router answer again. Replaces a script not used up.
+  void Script(std::vector<std::vector<uint8_t>> replies);
   void SetSilent(bool silent);
   // A public port some other device holds: the router gives another one.
   void TakePublicPort(uint8_t opcode, uint16_t port);
@@ -50,6 +55,8 @@ public:
   int Requests() const;
   std::vector<NatPmpRequest> ReceivedRequests() const;
   std::vector<Mapping> Table() const;
+  // Forgets the requests received.
+  void ResetRequests();
 
   // A reply in the wire format: version 0, opcode 128 + request opcode.
   static std::vector<uint8_t> MappingReply(uint8_t opcode, uint16_t result,
@@ -69,6 +76,8 @@ private:
 
   mutable std::mutex mMutex;
   Handler mHandler;
+  std::vector<std::vector<uint8_t>> mScript;
+  std::size_t mScriptNext = 0;
   bool mSilent = false;
   std::vector<Mapping> mTable;
   std::vector<std::pair<uint8_t, uint16_t>> mTaken;

@@ -1,5 +1,5 @@
 // The UPnP compatibility test against the fake router of
-// tests/portmap_router (a UPnP IGD on 127.0.0.1) and the probe service in
+// tests/portmap/support (a UPnP IGD on 127.0.0.1) and the probe service in
 // this process. On loopback nothing forwards anything, so the probe
 // service's checks go through RouterPath, which plays the router's data
 // path: a port is open from outside exactly when the fake's table maps it,

@@ -5,8 +5,8 @@
 //
 // Input: the first byte chooses the parser ('s' state, 'p' port text,
 // 'u' URL), the rest is its input.
-#ifndef ZARK_TESTS_PORTMAP_ROUTER_ROUTER_PARSERS_FUZZ_H
-#define ZARK_TESTS_PORTMAP_ROUTER_ROUTER_PARSERS_FUZZ_H
+#ifndef ZARK_FUZZ_ROUTER_PARSERS_FUZZ_H
+#define ZARK_FUZZ_ROUTER_PARSERS_FUZZ_H
 
 #include <string>
 #include <string_view>

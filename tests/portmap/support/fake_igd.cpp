@@ -13,8 +13,8 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <stdexcept>
 #include <strings.h>
+#include <thread>
 
 namespace zark::test {
 namespace {
@@ -73,6 +73,14 @@ const char *StatusText(int status) {
   switch (status) {
   case 200:
     return "OK";
+  case 301:
+    return "Moved Permanently";
+  case 302:
+    return "Found";
+  case 307:
+    return "Temporary Redirect";
+  case 308:
+    return "Permanent Redirect";
   case 404:
     return "Not Found";
   case 500:
@@ -80,6 +88,49 @@ const char *StatusText(int status) {
   default:
     return "Status";
   }
+}
+
+// The response's bytes: the raw ones a test wrote, or a response made of
+// status, Location and body.
+std::string ResponseBytes(const HttpReply &reply) {
+  if (reply.raw) {
+    return *reply.raw;
+  }
+  std::string response = "HTTP/1.1 " + std::to_string(reply.status) + " " +
+                         StatusText(reply.status) +
+                         "\r\nContent-Type: text/xml; charset=\"utf-8\""
+                         "\r\nConnection: close\r\nContent-Length: " +
+                         std::to_string(reply.body.size()) + "\r\n";
+  if (!reply.location.empty()) {
+    response += "Location: " + reply.location + "\r\n";
+  }
+  return response + "Server: fake-igd\r\n\r\n" + reply.body;
+}
+
+// Sends the response at once, or in pieces with a pause between them.
+void SendReply(int fd, const HttpReply &reply) {
+  const std::string response = ResponseBytes(reply);
+  if (reply.trickleBytes == 0) {
+    WriteAll(fd, response);
+    return;
+  }
+  for (std::size_t at = 0; at < response.size(); at += reply.trickleBytes) {
+    if (at != 0) {
+      std::this_thread::sleep_for(reply.trickleDelay);
+    }
+    WriteAll(fd, response.substr(at, reply.trickleBytes));
+  }
+}
+
+// The name of the body's first "<u:" element: "<u:AddPortMapping xmlns..."
+std::string BodyAction(const std::string &body) {
+  const std::size_t element = body.find("<u:");
+  if (element == std::string::npos) {
+    return {};
+  }
+  const std::size_t end = body.find_first_of(" />", element + 3);
+  return body.substr(element + 3, end == std::string::npos ? std::string::npos
+                                                           : end - element - 3);
 }
 
 std::string ServiceXml(const std::string &type, const std::string &id,
@@ -136,45 +187,66 @@ HttpReply SoapFault(int errorCode, const std::string &description) {
   return HttpReply{500, body};
 }
 
-FakeIgd::FakeIgd(IgdVariant variant) : mVariant(variant) {
+FakeIgd::FakeIgd(IgdVariant variant, const std::string &address)
+    : mVariant(variant), mAddress(address) {
   mListenFd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_in address{};
-  address.sin_family = AF_INET;
-  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t length = sizeof(address);
+  sockaddr_in bound{};
+  bound.sin_family = AF_INET;
+  socklen_t length = sizeof(bound);
   int pipeFds[2];
   if (mListenFd < 0 ||
-      ::bind(mListenFd, reinterpret_cast<sockaddr *>(&address),
-             sizeof(address)) != 0 ||
+      ::inet_pton(AF_INET, address.c_str(), &bound.sin_addr) != 1 ||
+      ::bind(mListenFd, reinterpret_cast<sockaddr *>(&bound), sizeof(bound)) !=
+          0 ||
       ::listen(mListenFd, 16) != 0 ||
-      ::getsockname(mListenFd, reinterpret_cast<sockaddr *>(&address),
-                    &length) != 0 ||
+      ::getsockname(mListenFd, reinterpret_cast<sockaddr *>(&bound), &length) !=
+          0 ||
       ::pipe2(pipeFds, O_CLOEXEC) != 0) {
-    std::perror("FakeIgd");
-    std::abort();
+    std::perror(("FakeIgd on " + address).c_str());
+    return;
   }
-  mPort = ntohs(address.sin_port);
+  mPort = ntohs(bound.sin_port);
   mWakeRead = pipeFds[0];
   mWakeWrite = pipeFds[1];
   mThread = std::thread([this] { Serve(); });
 }
 
 FakeIgd::~FakeIgd() {
-  char byte = 1;
-  (void)!::write(mWakeWrite, &byte, 1);
-  mThread.join();
-  ::close(mListenFd);
-  ::close(mWakeRead);
-  ::close(mWakeWrite);
+  if (mThread.joinable()) {
+    char byte = 1;
+    (void)!::write(mWakeWrite, &byte, 1);
+    mThread.join();
+  }
+  for (int fd : {mListenFd, mWakeRead, mWakeWrite}) {
+    if (fd >= 0) {
+      ::close(fd);
+    }
+  }
 }
 
-std::string FakeIgd::RootDescUrl() const {
-  return "http://127.0.0.1:" + std::to_string(mPort) + "/rootDesc.xml";
+std::string FakeIgd::Url(const std::string &path) const {
+  return "http://" + mAddress + ":" + std::to_string(mPort) + path;
 }
 
 void FakeIgd::OnAction(const std::string &action, Handler handler) {
   std::lock_guard<std::mutex> lock(mMutex);
   mHandlers[action] = std::move(handler);
+}
+
+void FakeIgd::OnAnyAction(Handler handler) {
+  std::lock_guard<std::mutex> lock(mMutex);
+  mAnyAction = std::move(handler);
+}
+
+void FakeIgd::OnGet(GetHandler handler) {
+  std::lock_guard<std::mutex> lock(mMutex);
+  mGet = std::move(handler);
+}
+
+void FakeIgd::Script(std::vector<HttpReply> replies) {
+  std::lock_guard<std::mutex> lock(mMutex);
+  mScript = std::move(replies);
+  mScriptNext = 0;
 }
 
 void FakeIgd::SetRootDescription(std::string xml) {
@@ -185,6 +257,16 @@ void FakeIgd::SetRootDescription(std::string xml) {
 void FakeIgd::SetControlUrl(std::string url) {
   std::lock_guard<std::mutex> lock(mMutex);
   mControlUrl = std::move(url);
+}
+
+void FakeIgd::SetUrlBase(std::string url) {
+  std::lock_guard<std::mutex> lock(mMutex);
+  mUrlBase = std::move(url);
+}
+
+void FakeIgd::SetExternalAddress(std::string address) {
+  std::lock_guard<std::mutex> lock(mMutex);
+  mExternalAddress = std::move(address);
 }
 
 void FakeIgd::SetConnectionStatus(const std::string &fragment,
@@ -238,10 +320,16 @@ std::vector<SoapRequest> FakeIgd::SoapRequests() const {
   return mRequests;
 }
 
+std::vector<std::string> FakeIgd::RequestLines() const {
+  std::lock_guard<std::mutex> lock(mMutex);
+  return mRequestLines;
+}
+
 void FakeIgd::ResetCounts() {
   std::lock_guard<std::mutex> lock(mMutex);
   mCounts.clear();
   mRequests.clear();
+  mRequestLines.clear();
 }
 
 std::vector<FakeIgd::Entry> FakeIgd::Table() const {
@@ -278,8 +366,9 @@ std::string FakeIgd::Description() const {
   return "<?xml version=\"1.0\"?>\r\n"
          "<root xmlns=\"urn:schemas-upnp-org:device-1-0\">"
          "<specVersion><major>1</major><minor>" +
-         std::string(v2 ? "1" : "0") +
-         "</minor></specVersion><device>"
+         std::string(v2 ? "1" : "0") + "</minor></specVersion>" +
+         (mUrlBase ? "<URLBase>" + *mUrlBase + "</URLBase>" : std::string()) +
+         "<device>"
          "<deviceType>urn:schemas-upnp-org:device:InternetGatewayDevice:" +
          version +
          "</deviceType><friendlyName>Fake router</friendlyName>"
@@ -381,7 +470,7 @@ HttpReply FakeIgd::BuiltIn(const SoapRequest &request) {
   }
   if (request.action == "GetExternalIPAddress") {
     return SoapResponse(type, request.action,
-                        {{"NewExternalIPAddress", "198.51.100.7"}});
+                        {{"NewExternalIPAddress", mExternalAddress}});
   }
   if (request.action == "GetStatusInfo") {
     std::string status = "Connected";
@@ -398,6 +487,62 @@ HttpReply FakeIgd::BuiltIn(const SoapRequest &request) {
   return SoapFault(401, "Invalid Action");
 }
 
+std::optional<HttpReply> FakeIgd::NextScripted() {
+  // Called with mMutex held.
+  if (mScriptNext >= mScript.size()) {
+    return std::nullopt;
+  }
+  return mScript[mScriptNext++];
+}
+
+HttpReply FakeIgd::AnswerGet(const std::string &path,
+                             std::unique_lock<std::mutex> &lock) {
+  if (std::optional<HttpReply> scripted = NextScripted()) {
+    return *scripted;
+  }
+  if (mStopAnswering) {
+    return HttpReply{.hang = true};
+  }
+  if (mGet) {
+    GetHandler copy = mGet;
+    lock.unlock();
+    std::optional<HttpReply> reply = copy(path);
+    lock.lock();
+    if (reply) {
+      return *reply;
+    }
+  }
+  if (path != "/rootDesc.xml") {
+    return HttpReply{404, ""};
+  }
+  return HttpReply{200, Description()};
+}
+
+HttpReply FakeIgd::AnswerSoap(const SoapRequest &request,
+                              std::unique_lock<std::mutex> &lock) {
+  if (std::optional<HttpReply> scripted = NextScripted()) {
+    return *scripted;
+  }
+  if (mStopAnswering) {
+    return HttpReply{.hang = true};
+  }
+  auto handler = mHandlers.find(request.action);
+  for (const Handler &chosen :
+       {handler != mHandlers.end() ? handler->second : Handler(), mAnyAction}) {
+    if (!chosen) {
+      continue;
+    }
+    Handler copy = chosen;
+    lock.unlock();
+    std::optional<HttpReply> reply = copy(request);
+    lock.lock();
+    if (reply) {
+      return *reply;
+    }
+  }
+  return BuiltIn(request);
+}
+
 HttpReply FakeIgd::Answer(const std::string &method, const std::string &path,
                           const std::map<std::string, std::string> &headers,
                           const std::string &body, bool &counted) {
@@ -405,13 +550,8 @@ HttpReply FakeIgd::Answer(const std::string &method, const std::string &path,
   counted = true;
   if (method == "GET") {
     ++mCounts["GET"];
-    if (mStopAnswering) {
-      return HttpReply{0, "", true};
-    }
-    if (path != "/rootDesc.xml") {
-      return HttpReply{404, ""};
-    }
-    return HttpReply{200, Description()};
+    mRequestLines.push_back("GET " + path);
+    return AnswerGet(path, lock);
   }
   SoapRequest request;
   request.path = path;
@@ -441,22 +581,11 @@ HttpReply FakeIgd::Answer(const std::string &method, const std::string &path,
       request.args[name] = *value;
     }
   }
+  request.bodyAction = BodyAction(body);
   ++mCounts[request.action];
   mRequests.push_back(request);
-  if (mStopAnswering) {
-    return HttpReply{0, "", true};
-  }
-  auto handler = mHandlers.find(request.action);
-  if (handler != mHandlers.end()) {
-    Handler copy = handler->second;
-    lock.unlock();
-    std::optional<HttpReply> reply = copy(request);
-    lock.lock();
-    if (reply) {
-      return *reply;
-    }
-  }
-  return BuiltIn(request);
+  mRequestLines.push_back("SOAP " + request.action);
+  return AnswerSoap(request, lock);
 }
 
 void FakeIgd::Serve() {
@@ -561,13 +690,7 @@ void FakeIgd::Serve() {
         continue;
       }
       if (!reply.close) {
-        std::string response = "HTTP/1.1 " + std::to_string(reply.status) +
-                               " " + StatusText(reply.status) +
-                               "\r\nContent-Type: text/xml; charset=\"utf-8\""
-                               "\r\nConnection: close\r\nContent-Length: " +
-                               std::to_string(reply.body.size()) +
-                               "\r\nServer: fake-igd\r\n\r\n" + reply.body;
-        WriteAll(connection.fd, response);
+        SendReply(connection.fd, reply);
       }
       done.push_back(i);
     }

@@ -1,7 +1,7 @@
 // The promises of the library's parser of probe service answers, checked on
 // any input (the fuzz target and the corpus test share them).
-#ifndef ZARK_TESTS_PORTTEST_PROBE_ANSWER_FUZZ_H
-#define ZARK_TESTS_PORTTEST_PROBE_ANSWER_FUZZ_H
+#ifndef ZARK_FUZZ_PROBE_ANSWER_FUZZ_H
+#define ZARK_FUZZ_PROBE_ANSWER_FUZZ_H
 
 #include <string>
 #include <string_view>

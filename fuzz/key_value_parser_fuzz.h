@@ -1,7 +1,7 @@
 // The promises of ParseKeyValueText, checked by the fuzz target and by the
 // corpus test.
-#ifndef ZARK_TESTS_KLIBC_KEY_VALUE_PARSER_FUZZ_H
-#define ZARK_TESTS_KLIBC_KEY_VALUE_PARSER_FUZZ_H
+#ifndef ZARK_FUZZ_KEY_VALUE_PARSER_FUZZ_H
+#define ZARK_FUZZ_KEY_VALUE_PARSER_FUZZ_H
 
 #include <string>
 #include <string_view>

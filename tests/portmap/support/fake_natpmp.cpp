@@ -83,6 +83,17 @@ void FakeNatPmp::SetHandler(Handler handler) {
   mHandler = std::move(handler);
 }
 
+void FakeNatPmp::Script(std::vector<std::vector<uint8_t>> replies) {
+  std::lock_guard<std::mutex> lock(mMutex);
+  mScript = std::move(replies);
+  mScriptNext = 0;
+}
+
+void FakeNatPmp::ResetRequests() {
+  std::lock_guard<std::mutex> lock(mMutex);
+  mRequests.clear();
+}
+
 void FakeNatPmp::SetSilent(bool silent) {
   std::lock_guard<std::mutex> lock(mMutex);
   mSilent = silent;
@@ -196,7 +207,9 @@ void FakeNatPmp::Serve() {
       }
       Handler handler = mHandler;
       std::optional<std::vector<uint8_t>> chosen;
-      if (handler) {
+      if (mScriptNext < mScript.size()) {
+        chosen = mScript[mScriptNext++];
+      } else if (handler) {
         lock.unlock();
         chosen = handler(request);
         lock.lock();
