@@ -12,6 +12,7 @@
 
 #include "base/port_mapping.h"
 #include "base/router_protocol.h"
+#include "zarkportforward.h"
 
 #include <cstdint>
 #include <string>
@@ -99,6 +100,15 @@ public:
   // True when the router takes only finite leases, so that mappings must be
   // renewed; the next job starts from it.
   [[nodiscard]] virtual bool FiniteLeases() const { return false; }
+
+  // What kind of failure a result of this driver is, for the administrator
+  // (ZARK_FAILURE_NONE for kOk and kNotFound). The default goes by the
+  // outcome alone; a protocol refines it by its own codes.
+  [[nodiscard]] virtual ZARK_FAILURE_KIND
+  FailureKind(const RouterResult &result) const;
+
+  // The longest one request waits for the router's answer, in seconds.
+  [[nodiscard]] virtual int AnswerDeadlineSeconds() const = 0;
 
   // The router's address on the internet side. kOk (address set), kRefused,
   // kNoAnswer, kBadReply, kNoRouter, kFailed.

@@ -575,6 +575,24 @@ RouterResult UpnpRouter::ListMappings(std::vector<RouterMapping> &entries) {
   return capped;
 }
 
+ZARK_FAILURE_KIND UpnpRouter::FailureKind(const RouterResult &result) const {
+  switch (result.code) {
+  case kUpnpConflictInMappingEntry:
+  case kUpnpConflictWithOtherMechanisms:
+    return ZARK_FAILURE_CONFLICT;
+  case kUpnpNoPortMapsAvailable:
+    return ZARK_FAILURE_TABLE_FULL;
+  case kUpnpOnlyPermanentLeases:
+    return ZARK_FAILURE_LEASE_REFUSED;
+  case kUpnpNotAuthorized:
+  case kUpnpSamePortValuesRequired:
+  case kUpnpWildcardExternalPort:
+    return ZARK_FAILURE_PORT_REFUSED;
+  default:
+    return RouterDriver::FailureKind(result);
+  }
+}
+
 RouterResult UpnpRouter::GetExternalAddress(std::string &address) {
   RouterResult opened = Open();
   if (!opened.Ok()) {

@@ -86,6 +86,10 @@ public:
   [[nodiscard]] RouterResult
   ListMappings(std::vector<RouterMapping> &entries) override;
   [[nodiscard]] RouterResult GetExternalAddress(std::string &address) override;
+  [[nodiscard]] ZARK_FAILURE_KIND
+  FailureKind(const RouterResult &result) const override;
+  // miniupnpc's 3 s to connect and 5 s of silence.
+  [[nodiscard]] int AnswerDeadlineSeconds() const override { return 8; }
 
   // The kind of lease the router took last (remembered for the next job).
   [[nodiscard]] LeaseKind CurrentLeaseKind() const { return mLeaseKind; }

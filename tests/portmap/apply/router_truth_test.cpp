@@ -1,0 +1,260 @@
+// The router, not the library's memory, is the source of truth: every save
+// verifies what the router holds and restores what it lost, a rule set that
+// passed the checks is kept when the router fails, each wanted mapping is
+// recorded with where it stands, and the status record says so. Request
+// counts are the fake router's own.
+// HERMETIC: real files under /etc/portforward and /tmp in a private mount
+// namespace.
+#include "catalog/mapping_state.h"
+#include "catalog/router_conf_store.h"
+#include "drivers/driver_choice.h"
+#include "fake_igd.h"
+#include "hermetic.h"
+#include "libzarkportmap.h"
+#include "zarkportforward.h"
+
+#include <gtest/gtest.h>
+#include <json/json.h>
+
+#include <cstring>
+#include <map>
+#include <memory>
+#include <string>
+#include <vector>
+
+namespace zark::portmap {
+namespace {
+
+using test::FakeIgd;
+using test::HttpReply;
+using test::SoapRequest;
+
+const char *const kGateway = "127.0.0.1";
+
+// An enabled rule forwarding routerPort to the same local port.
+ZARK_ROUTER_RULE SamePortRule(const char *id, const char *protocol,
+                              const char *ports) {
+  ZARK_ROUTER_RULE rule{};
+  std::snprintf(rule.rule_id, sizeof(rule.rule_id), "%s", id);
+  rule.enable = 1;
+  std::snprintf(rule.router_protocol, sizeof(rule.router_protocol), "%s",
+                protocol);
+  std::snprintf(rule.router_port, sizeof(rule.router_port), "%s", ports);
+  std::snprintf(rule.ds_port, sizeof(rule.ds_port), "%s", ports);
+  return rule;
+}
+
+// Five mappings: tcp 8001-8003, udp 5353, tcp 2222.
+std::vector<ZARK_ROUTER_RULE> FiveMappings() {
+  return {SamePortRule("range", "tcp", "8001-8003"),
+          SamePortRule("dns", "udp", "5353"),
+          SamePortRule("ssh", "tcp", "2222")};
+}
+
+// Every request the fake gets for these actions is answered by closing the
+// connection (a router that went away); nullopt handlers bring it back.
+void SilenceActions(FakeIgd &igd, bool silent) {
+  for (const char *action : {"AddPortMapping", "GetSpecificPortMappingEntry",
+                             "DeletePortMapping", "GetExternalIPAddress"}) {
+    igd.OnAction(action, [silent](const SoapRequest &) {
+      std::optional<HttpReply> reply;
+      if (silent) {
+        reply.emplace();
+        reply->close = true;
+      }
+      return reply;
+    });
+  }
+}
+
+struct TextDeleter {
+  void operator()(char *text) const { KLibFreeText(text); }
+};
+
+class PortMapApplyRouterTruth : public testing::Test {
+protected:
+  void SetUp() override {
+    test::ResetFixedPaths();
+    RouterOverrides overrides;
+    overrides.upnpRootDescUrls = {mIgd.RootDescUrl()};
+    overrides.localNetworks = {{0x7f000000u, 0xff000000u}};
+    SetRouterOverridesForTesting(overrides);
+    ZARK_ROUTER_CONF conf{};
+    std::strcpy(conf.brand, "Generic");
+    std::strcpy(conf.model, "Test");
+    std::strcpy(conf.version, "generic");
+    std::strcpy(conf.support_upnp, "yes");
+    std::strcpy(conf.support_natpmp, "no");
+    int err = 0;
+    ASSERT_TRUE(StoreRouterConfForGateway(kGateway, conf, err)) << err;
+  }
+  void TearDown() override { SetRouterOverridesForTesting(std::nullopt); }
+
+  // As the module saves: flag false.
+  int Save(std::vector<ZARK_ROUTER_RULE> rules) {
+    mResult = ZARK_ROUTER_SAVE_RULE_RESULT{};
+    return KLibSaveRules(kGateway, static_cast<int>(rules.size()),
+                         rules.data(), false, &mResult, nullptr, nullptr);
+  }
+
+  RouterRecord Record() {
+    MappingState state;
+    EXPECT_TRUE(LoadMappingState(kMappingStatePath, state));
+    const RouterRecord *record = state.Find(kGateway, RouterProtocol::kUpnp);
+    return record != nullptr ? *record : RouterRecord{};
+  }
+
+  Json::Value Status() {
+    char *raw = nullptr;
+    ZARK_LIBZARKPORTMAP_ERR err{-1};
+    EXPECT_EQ(0, KLibGetPortMapStatus(kGateway, &raw, &err));
+    EXPECT_EQ(ZARK_PORTMAP_ERR_NONE, err.err);
+    std::unique_ptr<char, TextDeleter> text(raw);
+    Json::Value root;
+    std::string errors;
+    std::unique_ptr<Json::CharReader> reader(
+        Json::CharReaderBuilder().newCharReader());
+    const char *begin = text ? text.get() : "";
+    EXPECT_TRUE(reader->parse(begin, begin + std::strlen(begin), &root,
+                              &errors))
+        << errors;
+    return root;
+  }
+
+  FakeIgd mIgd;
+  ZARK_ROUTER_SAVE_RULE_RESULT mResult{};
+};
+
+TEST(PortMapApplyFailureKinds, EachKindHasItsStableWord) {
+  const std::map<ZARK_FAILURE_KIND, std::string> words = {
+      {ZARK_FAILURE_NONE, ""},
+      {ZARK_FAILURE_ROUTER_NOT_ANSWERING, "router_not_answering"},
+      {ZARK_FAILURE_CONFLICT, "conflict"},
+      {ZARK_FAILURE_PORT_REFUSED, "port_refused"},
+      {ZARK_FAILURE_TABLE_FULL, "table_full"},
+      {ZARK_FAILURE_DOUBLE_NAT, "double_nat"},
+      {ZARK_FAILURE_LEASE_REFUSED, "lease_refused"},
+      {ZARK_FAILURE_NOT_CONFIGURED, "not_configured"},
+      {ZARK_FAILURE_LOCAL, "local"},
+      {ZARK_FAILURE_OTHER, "other"}};
+  for (const auto &[kind, word] : words) {
+    EXPECT_EQ(word, KLibFailureKindName(kind)) << kind;
+  }
+  EXPECT_STREQ("", KLibFailureKindName(static_cast<ZARK_FAILURE_KIND>(42)));
+}
+
+TEST_F(PortMapApplyRouterTruth, AnUnchangedSaveRestoresWhatTheRouterLost) {
+  ASSERT_EQ(0, Save(FiveMappings())) << mResult.detail.text;
+  // Two mappings deleted on the router behind the library's back.
+  std::vector<FakeIgd::Entry> table = mIgd.Table();
+  ASSERT_EQ(5u, table.size());
+  mIgd.ClearTable();
+  for (std::size_t i = 0; i < table.size(); ++i) {
+    if (table[i].externalPort != 8002 && table[i].externalPort != 5353) {
+      mIgd.PutEntry(table[i]);
+    }
+  }
+  mIgd.ResetCounts();
+
+  ASSERT_EQ(0, Save(FiveMappings())) << mResult.detail.text;
+
+  // Each mapping looked up, the two lost ones added and confirmed.
+  EXPECT_EQ((std::map<std::string, int>{{"GET", 1},
+                                        {"AddPortMapping", 2},
+                                        {"GetSpecificPortMappingEntry", 7}}),
+            mIgd.Counts());
+  EXPECT_EQ(5u, mIgd.Table().size());
+  RouterRecord record = Record();
+  ASSERT_TRUE(record.lastJob.has_value());
+  EXPECT_EQ("save", record.lastJob->kind);
+  EXPECT_TRUE(record.lastJob->ok);
+  EXPECT_EQ(2, record.lastJob->repaired);
+  EXPECT_EQ(2, record.lastJob->added);
+  for (const RecordedMapping &mapping : record.mappings) {
+    EXPECT_EQ(MappingApply::kOnRouter, mapping.apply) << mapping.externalPort;
+    EXPECT_GT(mapping.verified, 0);
+  }
+  Json::Value status = Status();
+  EXPECT_EQ(2, status["last_job"]["repaired"].asInt());
+  EXPECT_EQ("", status["last_job"]["failure"]["code"].asString());
+}
+
+TEST_F(PortMapApplyRouterTruth, RouterDownKeepsTheRulesPendingUntilARepair) {
+  ASSERT_EQ(0, Save({SamePortRule("ssh", "tcp", "2222")}));
+  SilenceActions(mIgd, true);
+
+  EXPECT_EQ(-1, Save(FiveMappings()));
+
+  // The error type of a failed apply, as before; the words say why.
+  EXPECT_EQ(static_cast<uint32_t>(ZARK_PORTMAP_ERR_ROUTER), mResult.errType);
+  EXPECT_NE(nullptr,
+            std::strstr(mResult.detail.text, "did not answer within 8 s"));
+  // The rules are kept, each mapping pending.
+  int count = 0;
+  ZARK_ROUTER_RULE *saved = nullptr;
+  ASSERT_EQ(0, KLibGetRulesArrFromRuleConf(&count, &saved, nullptr, false,
+                                           nullptr));
+  KLibFreeRulesArr(saved);
+  EXPECT_EQ(3, count);
+  Json::Value status = Status();
+  ASSERT_EQ(5u, status["rules"].size());
+  for (const Json::Value &rule : status["rules"]) {
+    EXPECT_EQ("pending", rule["state"].asString())
+        << rule["external_port"].asInt();
+  }
+  EXPECT_EQ("router_not_answering",
+            status["last_job"]["failure"]["code"].asString());
+  EXPECT_FALSE(status["last_job"]["ok"].asBool());
+
+  // The router is back: a repair applies them.
+  SilenceActions(mIgd, false);
+  mIgd.ResetCounts();
+  ZARK_PORTMAP_APPLY_SUMMARY summary{};
+  ZARK_ROUTER_SAVE_RULE_RESULT result{};
+  ASSERT_EQ(0, KLibRepairSavedRules(kGateway, &summary, &result, nullptr,
+                                    nullptr))
+      << result.detail.text;
+  EXPECT_EQ(4, summary.added);
+  EXPECT_EQ(4, mIgd.Count("AddPortMapping"));
+  EXPECT_EQ(5u, mIgd.Table().size());
+  status = Status();
+  EXPECT_EQ("repair", status["last_job"]["kind"].asString());
+  EXPECT_EQ("198.51.100.7", status["external_address"].asString());
+  for (const Json::Value &rule : status["rules"]) {
+    EXPECT_EQ("on_router", rule["state"].asString())
+        << rule["external_port"].asInt();
+    EXPECT_GT(rule["verified"].asInt64(), 0);
+  }
+}
+
+TEST_F(PortMapApplyRouterTruth, AForeignMappingIsLeftAloneAndNamed) {
+  mIgd.PutEntry({"TCP", 2222, "127.0.0.9", 22, 0, "game console"});
+
+  EXPECT_EQ(-1, Save(FiveMappings()));
+
+  EXPECT_EQ(static_cast<uint32_t>(ZARK_PORTMAP_ERR_ROUTER), mResult.errType);
+  EXPECT_NE(nullptr, std::strstr(mResult.detail.text,
+                                 "conflict with another mapping"));
+  EXPECT_NE(nullptr, std::strstr(mResult.detail.text, "\"game console\""));
+  EXPECT_EQ(5u, mIgd.Table().size());
+  EXPECT_EQ(0, mIgd.Count("DeletePortMapping"));
+  Json::Value status = Status();
+  for (const Json::Value &rule : status["rules"]) {
+    const bool ssh = rule["external_port"].asInt() == 2222;
+    EXPECT_EQ(ssh ? "refused" : "on_router", rule["state"].asString());
+    EXPECT_EQ(ssh ? "conflict" : "", rule["code"].asString());
+    if (ssh) {
+      EXPECT_NE(std::string::npos,
+                rule["reason"].asString().find("game console"));
+    }
+  }
+  // A repair tries again and still leaves it alone.
+  ZARK_PORTMAP_APPLY_SUMMARY summary{};
+  EXPECT_EQ(-1, KLibRepairSavedRules(kGateway, &summary, nullptr, nullptr,
+                                     nullptr));
+  EXPECT_EQ(1, summary.failed);
+  EXPECT_EQ("127.0.0.9", mIgd.Table()[0].client);
+}
+
+} // namespace
+} // namespace zark::portmap
