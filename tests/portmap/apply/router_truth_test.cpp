@@ -27,6 +27,7 @@ namespace {
 
 using test::FakeIgd;
 using test::HttpReply;
+using test::IgdVariant;
 using test::SoapRequest;
 
 const char *const kGateway = "127.0.0.1";
@@ -73,6 +74,8 @@ struct TextDeleter {
 
 class PortMapApplyRouterTruth : public testing::Test {
 protected:
+  explicit PortMapApplyRouterTruth(IgdVariant variant = IgdVariant::kIpV1)
+      : mIgd(variant) {}
   void SetUp() override {
     test::ResetFixedPaths();
     RouterOverrides overrides;
@@ -93,8 +96,8 @@ protected:
   // As the module saves: flag false.
   int Save(std::vector<ZARK_ROUTER_RULE> rules) {
     mResult = ZARK_ROUTER_SAVE_RULE_RESULT{};
-    return KLibSaveRules(kGateway, static_cast<int>(rules.size()),
-                         rules.data(), false, &mResult, nullptr, nullptr);
+    return KLibSaveRules(kGateway, static_cast<int>(rules.size()), rules.data(),
+                         false, &mResult, nullptr, nullptr);
   }
 
   RouterRecord Record() {
@@ -115,8 +118,8 @@ protected:
     std::unique_ptr<Json::CharReader> reader(
         Json::CharReaderBuilder().newCharReader());
     const char *begin = text ? text.get() : "";
-    EXPECT_TRUE(reader->parse(begin, begin + std::strlen(begin), &root,
-                              &errors))
+    EXPECT_TRUE(
+        reader->parse(begin, begin + std::strlen(begin), &root, &errors))
         << errors;
     return root;
   }
@@ -192,8 +195,8 @@ TEST_F(PortMapApplyRouterTruth, RouterDownKeepsTheRulesPendingUntilARepair) {
   // The rules are kept, each mapping pending.
   int count = 0;
   ZARK_ROUTER_RULE *saved = nullptr;
-  ASSERT_EQ(0, KLibGetRulesArrFromRuleConf(&count, &saved, nullptr, false,
-                                           nullptr));
+  ASSERT_EQ(
+      0, KLibGetRulesArrFromRuleConf(&count, &saved, nullptr, false, nullptr));
   KLibFreeRulesArr(saved);
   EXPECT_EQ(3, count);
   Json::Value status = Status();
@@ -211,8 +214,8 @@ TEST_F(PortMapApplyRouterTruth, RouterDownKeepsTheRulesPendingUntilARepair) {
   mIgd.ResetCounts();
   ZARK_PORTMAP_APPLY_SUMMARY summary{};
   ZARK_ROUTER_SAVE_RULE_RESULT result{};
-  ASSERT_EQ(0, KLibRepairSavedRules(kGateway, &summary, &result, nullptr,
-                                    nullptr))
+  ASSERT_EQ(0,
+            KLibRepairSavedRules(kGateway, &summary, &result, nullptr, nullptr))
       << result.detail.text;
   EXPECT_EQ(4, summary.added);
   EXPECT_EQ(4, mIgd.Count("AddPortMapping"));
@@ -233,8 +236,8 @@ TEST_F(PortMapApplyRouterTruth, AForeignMappingIsLeftAloneAndNamed) {
   EXPECT_EQ(-1, Save(FiveMappings()));
 
   EXPECT_EQ(static_cast<uint32_t>(ZARK_PORTMAP_ERR_ROUTER), mResult.errType);
-  EXPECT_NE(nullptr, std::strstr(mResult.detail.text,
-                                 "conflict with another mapping"));
+  EXPECT_NE(nullptr,
+            std::strstr(mResult.detail.text, "conflict with another mapping"));
   EXPECT_NE(nullptr, std::strstr(mResult.detail.text, "\"game console\""));
   EXPECT_EQ(5u, mIgd.Table().size());
   EXPECT_EQ(0, mIgd.Count("DeletePortMapping"));
@@ -250,10 +253,91 @@ TEST_F(PortMapApplyRouterTruth, AForeignMappingIsLeftAloneAndNamed) {
   }
   // A repair tries again and still leaves it alone.
   ZARK_PORTMAP_APPLY_SUMMARY summary{};
-  EXPECT_EQ(-1, KLibRepairSavedRules(kGateway, &summary, nullptr, nullptr,
-                                     nullptr));
+  EXPECT_EQ(
+      -1, KLibRepairSavedRules(kGateway, &summary, nullptr, nullptr, nullptr));
   EXPECT_EQ(1, summary.failed);
   EXPECT_EQ("127.0.0.9", mIgd.Table()[0].client);
+}
+
+// The same against an IGD:2 router, which lists a port range in one request.
+class PortMapApplyRouterTruthIgd2 : public PortMapApplyRouterTruth {
+protected:
+  PortMapApplyRouterTruthIgd2()
+      : PortMapApplyRouterTruth(IgdVariant::kIpV2Only) {}
+};
+
+// 100 TCP and 100 UDP mappings, ports 10000-10099.
+std::vector<ZARK_ROUTER_RULE> TwoHundredMappings() {
+  return {SamePortRule("tcp", "tcp", "10000-10099"),
+          SamePortRule("udp", "udp", "10000-10099")};
+}
+
+TEST_F(PortMapApplyRouterTruthIgd2, ListingsVerifyAndConfirmTwoHundred) {
+  ASSERT_EQ(0, Save(TwoHundredMappings())) << mResult.detail.text;
+  // One listing per protocol before, the adds, one listing each after.
+  EXPECT_EQ((std::map<std::string, int>{{"GET", 1},
+                                        {"GetListOfPortMappings", 4},
+                                        {"AddPortMapping", 200}}),
+            mIgd.Counts());
+  EXPECT_EQ(200u, mIgd.Table().size());
+
+  mIgd.ResetCounts();
+  ASSERT_EQ(0, Save(TwoHundredMappings())) << mResult.detail.text;
+  EXPECT_EQ(2, mIgd.Count("GetListOfPortMappings"));
+  EXPECT_EQ(0, mIgd.Count("AddPortMapping"));
+  EXPECT_EQ(0, mIgd.Count("GetSpecificPortMappingEntry"));
+
+  // Two TCP mappings lost: one listing each, two adds, one confirmation.
+  std::vector<FakeIgd::Entry> table = mIgd.Table();
+  mIgd.ClearTable();
+  for (const FakeIgd::Entry &entry : table) {
+    if (entry.protocol != "TCP" ||
+        (entry.externalPort != 10005 && entry.externalPort != 10050)) {
+      mIgd.PutEntry(entry);
+    }
+  }
+  mIgd.ResetCounts();
+  ASSERT_EQ(0, Save(TwoHundredMappings())) << mResult.detail.text;
+  EXPECT_EQ((std::map<std::string, int>{{"GET", 1},
+                                        {"GetListOfPortMappings", 3},
+                                        {"AddPortMapping", 2}}),
+            mIgd.Counts());
+  EXPECT_EQ(200u, mIgd.Table().size());
+  EXPECT_EQ(2, Record().lastJob->repaired);
+}
+
+TEST_F(PortMapApplyRouterTruthIgd2, AnotherProgramsMappingOnThisServerIsKept) {
+  // Same client as ours: the router would let our add replace it.
+  mIgd.PutEntry({"TCP", 2222, "127.0.0.1", 22, 0, "other program"});
+
+  EXPECT_EQ(-1, Save(FiveMappings()));
+
+  EXPECT_NE(nullptr, std::strstr(mResult.detail.text, "\"other program\""));
+  for (const SoapRequest &request : mIgd.SoapRequests()) {
+    if (request.action == "AddPortMapping") {
+      EXPECT_NE("2222", request.Arg("NewExternalPort"));
+    }
+  }
+  EXPECT_EQ(5u, mIgd.Table().size());
+  EXPECT_EQ("other program", mIgd.Table()[0].description);
+  const RecordedMapping *ssh = Record().Find(IpProtocol::kTcp, 2222);
+  ASSERT_NE(nullptr, ssh);
+  EXPECT_EQ(MappingApply::kRefused, ssh->apply);
+  EXPECT_EQ(ZARK_FAILURE_CONFLICT, ssh->failure);
+}
+
+TEST_F(PortMapApplyRouterTruthIgd2, TheConfirmingListingCatchesADroppedAdd) {
+  mIgd.SetTableCapacity(2);
+
+  EXPECT_EQ(-1, Save({SamePortRule("range", "tcp", "8001-8003")}));
+
+  EXPECT_EQ(3, mIgd.Count("AddPortMapping"));
+  EXPECT_EQ(0, mIgd.Count("GetSpecificPortMappingEntry"));
+  EXPECT_NE(nullptr, std::strstr(mResult.detail.text, "table is full"));
+  const RecordedMapping *third = Record().Find(IpProtocol::kTcp, 8003);
+  ASSERT_NE(nullptr, third);
+  EXPECT_EQ(MappingApply::kRefused, third->apply);
+  EXPECT_EQ(ZARK_FAILURE_TABLE_FULL, third->failure);
 }
 
 } // namespace

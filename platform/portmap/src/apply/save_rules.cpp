@@ -42,6 +42,7 @@ struct Step {
   std::optional<RecordedMapping> before;
   bool attempted = false;
   bool missing = false; // the router was asked and had lost it
+  bool refresh = false; // held, re-added to renew its lease
 
   [[nodiscard]] Key PortKey() const {
     return {mapping.protocol, mapping.externalPort};
@@ -108,10 +109,27 @@ private:
   enum class Checked { kHeld, kMoved, kLost, kAddAgain, kRouterGone };
   Checked CheckStillHeld(RouterDriver &router, const Step &step,
                          const std::string &where);
+  Checked HeldByAnother(const Step &step, const std::string &where,
+                        const RouterMapping &entry);
   // Adds the step's mapping and records the router's answer; where names
   // the rule and port in messages.
-  void AddMapping(RouterDriver &router, const Step &step,
-                  const std::string &where);
+  // unconfirmed: the add is confirmed later by one listing
+  // (ConfirmListed).
+  void AddMapping(RouterDriver &router, Step &step, const std::string &where,
+                  bool unconfirmed = false);
+  // Where the router lists port ranges (IGD:2): reads the wanted ports of
+  // each protocol, one listing each. False when it cannot (then every
+  // mapping is looked up on its own) or the router stopped answering
+  // (mAborted).
+  bool ListWanted(RouterDriver &router, std::map<Key, RouterMapping> &listed,
+                  bool onlyAdded);
+  // What the listing says of a step's port: kHeld (ours, as wanted; no
+  // request needed), kMoved (another mapping holds it: left alone, reported),
+  // kLost (a held one is gone), kAddAgain (to add).
+  Checked CheckListed(const Step &step, const std::string &where,
+                      const std::map<Key, RouterMapping> &listed);
+  // Confirms the adds of mUnconfirmed with one listing per protocol.
+  void ConfirmListed(RouterDriver &router);
   void OnAddConflict(RouterDriver &router, const Step &step,
                      const std::string &where, const RouterResult &added);
   void OnAddTableFull(RouterDriver &router, const Step &step,
@@ -146,6 +164,7 @@ private:
   int mDeleteDone = 0;
   bool mAborted = false;
   RouterDriver *mRouter = nullptr;
+  std::vector<Step *> mUnconfirmed; // added, to be seen in a listing
   ZARK_FAILURE_KIND mFailureKind = ZARK_FAILURE_NONE;
   std::string mFailureReason;
   ApplySummary *mSummary = nullptr;
@@ -287,6 +306,7 @@ void Applier::Plan(const std::vector<WantedMapping> &wanted) {
     } else if (mOptions.refreshLeases && recorded->expires != 0 &&
                recorded->expires - now < mEnv.renewAhead.count()) {
       step.kind = Step::Kind::kAdd;
+      step.refresh = true;
     } else if (mOptions.verifyUnchanged) {
       step.kind = Step::Kind::kCheck;
     } else {
@@ -438,6 +458,19 @@ void Applier::RecordAdded(const Step &step, const RouterResult &added) {
   Record().Put(entry);
 }
 
+Applier::Checked Applier::HeldByAnother(const Step &step,
+                                        const std::string &where,
+                                        const RouterMapping &entry) {
+  // Another mapping holds the port: never taken over, reported with it.
+  ++mSummary->failed;
+  const std::string reason =
+      where + " is held on the router by " + entry.internalClient + ":" +
+      std::to_string(entry.internalPort) + " (\"" + entry.description + "\")";
+  RecordRefused(step, ZARK_FAILURE_CONFLICT, reason);
+  Fail(kSaveErrRouter, reason, ZARK_FAILURE_CONFLICT);
+  return Checked::kMoved;
+}
+
 Applier::Checked Applier::CheckStillHeld(RouterDriver &router, const Step &step,
                                          const std::string &where) {
   const Key key = step.PortKey();
@@ -455,14 +488,7 @@ Applier::Checked Applier::CheckStillHeld(RouterDriver &router, const Step &step,
       RecordAdded(step, held);
       return Checked::kHeld;
     }
-    ++mSummary->failed;
-    // Another mapping holds the port now: never taken over.
-    const std::string reason =
-        where + " is held on the router by " + entry.internalClient + ":" +
-        std::to_string(entry.internalPort) + " (\"" + entry.description + "\")";
-    RecordRefused(step, ZARK_FAILURE_CONFLICT, reason);
-    Fail(kSaveErrRouter, reason, ZARK_FAILURE_CONFLICT);
-    return Checked::kMoved;
+    return HeldByAnother(step, where, entry);
   }
   if (IsRouterGone(checked.outcome)) {
     FailFromRouter(checked, where);
@@ -482,12 +508,18 @@ Applier::Checked Applier::CheckStillHeld(RouterDriver &router, const Step &step,
                                                      : Checked::kAddAgain;
 }
 
-void Applier::AddMapping(RouterDriver &router, const Step &step,
-                         const std::string &where) {
+void Applier::AddMapping(RouterDriver &router, Step &step,
+                         const std::string &where, bool unconfirmed) {
   ++mSummary->operations;
-  RouterResult added = router.AddPortMapping(step.mapping);
+  RouterResult added = unconfirmed
+                           ? router.AddPortMappingUnconfirmed(step.mapping)
+                           : router.AddPortMapping(step.mapping);
   switch (added.outcome) {
   case RouterOutcome::kOk:
+    if (unconfirmed) {
+      mUnconfirmed.push_back(&step);
+      break;
+    }
     ++mSummary->added;
     if (step.missing) {
       ++mSummary->repaired;
@@ -586,9 +618,128 @@ void Applier::SaveStateNowAndThen() {
   }
 }
 
+bool Applier::ListWanted(RouterDriver &router,
+                         std::map<Key, RouterMapping> &listed, bool onlyAdded) {
+  listed.clear();
+  std::map<IpProtocol, std::pair<uint16_t, uint16_t>> ranges;
+  auto widen = [&ranges](const Step &step) {
+    auto [it, added] =
+        ranges.try_emplace(step.mapping.protocol, step.mapping.externalPort,
+                           step.mapping.externalPort);
+    if (!added) {
+      it->second.first = std::min(it->second.first, step.mapping.externalPort);
+      it->second.second =
+          std::max(it->second.second, step.mapping.externalPort);
+    }
+  };
+  if (onlyAdded) {
+    for (const Step *step : mUnconfirmed) {
+      widen(*step);
+    }
+  } else {
+    for (const Step &step : mAdditions) {
+      widen(step);
+    }
+  }
+  for (const auto &[protocol, range] : ranges) {
+    std::vector<RouterMapping> entries;
+    ++mSummary->operations;
+    RouterResult read =
+        router.ListPortRange(protocol, range.first, range.second, entries);
+    if (read.outcome == RouterOutcome::kUnsupported) {
+      return false;
+    }
+    if (!read.Ok()) {
+      if (IsRouterGone(read.outcome)) {
+        FailFromRouter(read, "listing the router's mappings");
+        mAborted = true;
+      }
+      return false;
+    }
+    for (RouterMapping &entry : entries) {
+      const Key key{entry.protocol, entry.externalPort};
+      listed.emplace(key, std::move(entry));
+    }
+  }
+  return true;
+}
+
+Applier::Checked
+Applier::CheckListed(const Step &step, const std::string &where,
+                     const std::map<Key, RouterMapping> &listed) {
+  auto found = listed.find(step.PortKey());
+  if (found == listed.end()) {
+    return step.kind == Step::Kind::kCheck ? Checked::kLost
+                                           : Checked::kAddAgain;
+  }
+  const RouterMapping &entry = found->second;
+  const bool sameTarget = entry.internalClient == step.mapping.internalClient &&
+                          entry.internalPort == step.mapping.internalPort;
+  // Ours: made for this server under our description. A mapping of this
+  // server under another description is another program's: the router
+  // would let our add replace it.
+  const bool ours = entry.internalClient == step.mapping.internalClient &&
+                    entry.description.starts_with(MappingDescription(""));
+  if (!ours) {
+    return HeldByAnother(step, where, entry);
+  }
+  if (sameTarget && !step.refresh) {
+    if (step.kind == Step::Kind::kCheck) {
+      ++mSummary->checked;
+    }
+    RouterResult held;
+    held.outcome = RouterOutcome::kOk;
+    held.leaseSeconds = entry.leaseSeconds;
+    RecordAdded(step, held);
+    return Checked::kHeld;
+  }
+  return Checked::kAddAgain;
+}
+
+void Applier::ConfirmListed(RouterDriver &router) {
+  std::map<Key, RouterMapping> listed;
+  if (mUnconfirmed.empty() || !ListWanted(router, listed, true)) {
+    // Unconfirmed adds stay "not known to be held" (pending).
+    return;
+  }
+  for (Step *step : mUnconfirmed) {
+    const std::string where =
+        "rule \"" + step->ruleId + "\", router port " +
+        PortText(step->mapping.protocol, step->mapping.externalPort);
+    auto found = listed.find(step->PortKey());
+    if (found == listed.end() ||
+        found->second.internalClient != step->mapping.internalClient ||
+        found->second.internalPort != step->mapping.internalPort) {
+      // Answered success and kept nothing, or evicted by a later add.
+      ++mSummary->failed;
+      const std::string reason =
+          where + ": the router answered success but does not hold it";
+      RecordRefused(*step, ZARK_FAILURE_TABLE_FULL, reason);
+      Fail(kSaveErrRouter, reason, ZARK_FAILURE_TABLE_FULL);
+      continue;
+    }
+    ++mSummary->added;
+    if (step->missing) {
+      ++mSummary->repaired;
+      syslog(LOG_INFO, "%s:%d %s: restored on the router at %s", __FILE__,
+             __LINE__, where.c_str(), mGateway.c_str());
+    }
+    RouterResult held;
+    held.outcome = RouterOutcome::kOk;
+    held.leaseSeconds = found->second.leaseSeconds;
+    RecordAdded(*step, held);
+  }
+  mUnconfirmed.clear();
+}
+
 void Applier::RunAdditions(RouterDriver &router) {
   const int total = static_cast<int>(mAdditions.size());
   int done = 0;
+  std::map<Key, RouterMapping> listed;
+  const bool listing = !mAdditions.empty() && ListWanted(router, listed, false);
+  if (mAborted) {
+    return;
+  }
   for (Step &step : mAdditions) {
     if (mAborted) {
       break;
@@ -604,7 +755,10 @@ void Applier::RunAdditions(RouterDriver &router) {
         "rule \"" + step.ruleId + "\", router port " +
         PortText(step.mapping.protocol, step.mapping.externalPort);
     Checked checked = Checked::kAddAgain;
-    if (step.kind == Step::Kind::kCheck) {
+    if (listing) {
+      checked = CheckListed(step, where, listed);
+      step.missing = checked == Checked::kLost;
+    } else if (step.kind == Step::Kind::kCheck) {
       checked = CheckStillHeld(router, step, where);
       if (checked == Checked::kRouterGone) {
         step.attempted = false;
@@ -613,11 +767,14 @@ void Applier::RunAdditions(RouterDriver &router) {
       step.missing = checked == Checked::kLost;
     }
     if (checked == Checked::kAddAgain || checked == Checked::kLost) {
-      AddMapping(router, step, where);
+      AddMapping(router, step, where, listing);
     }
     ++done;
     mProgress.Report("add", done, total);
     SaveStateNowAndThen();
+  }
+  if (listing && !mAborted) {
+    ConfirmListed(router);
   }
 }
 

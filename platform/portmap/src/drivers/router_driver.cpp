@@ -28,6 +28,17 @@ const char *RouterOutcomeName(RouterOutcome outcome) {
   return "unknown";
 }
 
+RouterResult RouterDriver::ListPortRange(IpProtocol /*protocol*/,
+                                         uint16_t /*firstPort*/,
+                                         uint16_t /*lastPort*/,
+                                         std::vector<RouterMapping> &entries) {
+  entries.clear();
+  RouterResult result;
+  result.outcome = RouterOutcome::kUnsupported;
+  result.message = "the router cannot list a port range";
+  return result;
+}
+
 ZARK_FAILURE_KIND RouterDriver::FailureKind(const RouterResult &result) const {
   switch (result.outcome) {
   case RouterOutcome::kOk:

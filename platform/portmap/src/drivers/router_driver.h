@@ -97,6 +97,24 @@ public:
   [[nodiscard]] virtual RouterResult
   ListMappings(std::vector<RouterMapping> &entries) = 0;
 
+  // Reads the router's mappings of one protocol whose external ports lie in
+  // [firstPort, lastPort], a page of many entries per request, where the
+  // protocol can (IGD:2's GetListOfPortMappings). The entries come in port
+  // order. kOk, kUnsupported (this router cannot: IGD:1, NAT-PMP), kRefused,
+  // kNoAnswer, kBadReply, kNoRouter, kFailed.
+  [[nodiscard]] virtual RouterResult
+  ListPortRange(IpProtocol protocol, uint16_t firstPort, uint16_t lastPort,
+                std::vector<RouterMapping> &entries);
+
+  // Adds a mapping without reading it back: for a caller that confirms a
+  // batch of adds with ListPortRange. Drivers that confirm otherwise (by the
+  // answer itself, NAT-PMP) just add. Results as AddPortMapping's; kOk means
+  // only that the router answered success (leaseSeconds not known).
+  [[nodiscard]] virtual RouterResult
+  AddPortMappingUnconfirmed(const PortMapping &mapping) {
+    return AddPortMapping(mapping);
+  }
+
   // True when the router takes only finite leases, so that mappings must be
   // renewed; the next job starts from it.
   [[nodiscard]] virtual bool FiniteLeases() const { return false; }
