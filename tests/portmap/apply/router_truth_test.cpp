@@ -5,6 +5,7 @@
 // counts are the fake router's own.
 // HERMETIC: real files under /etc/portforward and /tmp in a private mount
 // namespace.
+#include "apply_test_support.h"
 #include "catalog/mapping_state.h"
 #include "catalog/router_conf_store.h"
 #include "drivers/driver_choice.h"
@@ -29,21 +30,10 @@ using test::FakeIgd;
 using test::HttpReply;
 using test::IgdVariant;
 using test::SoapRequest;
+using test_support::SamePortRule;
+using test_support::StoreGenericRouter;
 
 const char *const kGateway = "127.0.0.1";
-
-// An enabled rule forwarding routerPort to the same local port.
-ZARK_ROUTER_RULE SamePortRule(const char *id, const char *protocol,
-                              const char *ports) {
-  ZARK_ROUTER_RULE rule{};
-  std::snprintf(rule.rule_id, sizeof(rule.rule_id), "%s", id);
-  rule.enable = 1;
-  std::snprintf(rule.router_protocol, sizeof(rule.router_protocol), "%s",
-                protocol);
-  std::snprintf(rule.router_port, sizeof(rule.router_port), "%s", ports);
-  std::snprintf(rule.ds_port, sizeof(rule.ds_port), "%s", ports);
-  return rule;
-}
 
 // Five mappings: tcp 8001-8003, udp 5353, tcp 2222.
 std::vector<ZARK_ROUTER_RULE> FiveMappings() {
@@ -82,14 +72,7 @@ protected:
     overrides.upnpRootDescUrls = {mIgd.RootDescUrl()};
     overrides.localNetworks = {{0x7f000000u, 0xff000000u}};
     SetRouterOverridesForTesting(overrides);
-    ZARK_ROUTER_CONF conf{};
-    std::strcpy(conf.brand, "Generic");
-    std::strcpy(conf.model, "Test");
-    std::strcpy(conf.version, "generic");
-    std::strcpy(conf.support_upnp, "yes");
-    std::strcpy(conf.support_natpmp, "no");
-    int err = 0;
-    ASSERT_TRUE(StoreRouterConfForGateway(kGateway, conf, err)) << err;
+    StoreGenericRouter(kGateway, true);
   }
   void TearDown() override { SetRouterOverridesForTesting(std::nullopt); }
 

@@ -3,6 +3,9 @@
 // our mappings.
 #include "zarkportforward.h"
 
+#include "api/saved_rules_access.h"
+#include "apply/keeper.h"
+#include "apply/save_rules.h"
 #include "base/failure_kind.h"
 #include "base/portmap_log.h"
 #include "catalog/mapping_state.h"
@@ -12,6 +15,7 @@
 
 #include <json/json.h>
 
+#include <algorithm>
 #include <climits>
 #include <cstdio>
 #include <cstdlib>
@@ -30,13 +34,6 @@ void SetErr(ZARK_LIBZARKPORTMAP_ERR *err, int32_t code) {
   }
 }
 
-// An entry point whose work is not built yet: it fails loudly.
-int NotBuiltYet(const char *function, ZARK_LIBZARKPORTMAP_ERR *err) {
-  ZARK_PM_LOG_ERROR("%s: not built yet", function);
-  SetErr(err, ZARK_PORTMAP_ERR_NOT_IMPLEMENTED);
-  return -1;
-}
-
 } // namespace
 
 extern "C" const char *KLibFailureKindName(ZARK_FAILURE_KIND kind) {
@@ -49,10 +46,6 @@ extern "C" void KLibFreeText(char *text) {
 
 namespace zark::portmap {
 namespace {
-
-struct RulesArrayDeleter {
-  void operator()(ZARK_ROUTER_RULE *rules) const { KLibFreeRulesArr(rules); }
-};
 
 Json::Value FailureJson(ZARK_FAILURE_KIND kind, const std::string &reason) {
   Json::Value failure(Json::objectValue);
@@ -186,30 +179,155 @@ extern "C" int KLibGetPortMapStatus(const char *gatewayIP, char **json,
   }
 }
 
-extern "C" int KLibKeepRouter(const char * /*gatewayIP*/,
-                              int checkIntervalSeconds, int *nextSeconds,
+namespace zark::portmap {
+namespace {
+
+void Message(char *message, size_t size, const std::string &text) {
+  if (message != nullptr && size > 0) {
+    std::snprintf(message, size, "%s", text.c_str());
+  }
+}
+
+int DeleteOurMapping(const std::string &gatewayText, IpProtocol protocol,
+                     uint16_t port, char *message, size_t messageSize,
+                     ZARK_LIBZARKPORTMAP_ERR *err) {
+  const std::string what =
+      std::string(ProtocolText(protocol)) + " " + std::to_string(port);
+  std::optional<std::string> gateway = CanonicalGatewayAddress(gatewayText);
+  if (!gateway || port == 0) {
+    Message(message, messageSize, "bad gateway or port");
+    SetErr(err, ZARK_PORTMAP_ERR_BAD_PARAMETER);
+    return -1;
+  }
+  const ApplyEnvironment environment = DefaultApplyEnvironment();
+  RouterChoice choice;
+  int code = ZARK_PORTMAP_ERR_NONE;
+  if (!environment.chooseRouter(*gateway, choice, code)) {
+    Message(message, messageSize, "no router is configured for " + *gateway);
+    SetErr(err, code);
+    return -1;
+  }
+  MappingState state;
+  if (!LoadMappingState(environment.statePath, state)) {
+    Message(message, messageSize, "the record of our mappings is unreadable");
+    SetErr(err, ZARK_PORTMAP_ERR_IO);
+    return -1;
+  }
+  RouterRecord *record = state.Find(*gateway, choice.protocol);
+  const RecordedMapping *entry =
+      record != nullptr ? record->Find(protocol, port) : nullptr;
+  if (entry == nullptr || entry->apply == MappingApply::kRefused) {
+    Message(message, messageSize, what + " is not a mapping this server made");
+    SetErr(err, ZARK_PORTMAP_ERR_BAD_PARAMETER);
+    return -1;
+  }
+  std::unique_ptr<RouterDriver> router =
+      environment.makeRouter(choice.protocol, *gateway, record);
+  if (router == nullptr) {
+    Message(message, messageSize, "the router cannot be reached");
+    SetErr(err, ZARK_PORTMAP_ERR_ROUTER);
+    return -1;
+  }
+  // Where the router can be asked, make sure the port is still ours there:
+  // another device or program may hold it since.
+  RouterMapping held;
+  RouterResult looked = router->GetSpecificPortMapping(protocol, port, held);
+  if (looked.Ok() && (held.internalClient != entry->internalClient ||
+                      !held.description.starts_with(MappingDescription("")))) {
+    Message(message, messageSize,
+            what + " is held on the router by " + held.internalClient + " (\"" +
+                held.description + "\"), not by this server");
+    SetErr(err, ZARK_PORTMAP_ERR_BAD_PARAMETER);
+    return -1;
+  }
+  RouterResult deleted =
+      looked.outcome == RouterOutcome::kNotFound
+          ? looked
+          : router->DeletePortMapping({protocol, port, entry->internalPort,
+                                       entry->internalClient,
+                                       MappingDescription(entry->ruleId)});
+  if (!deleted.Ok() && deleted.outcome != RouterOutcome::kNotFound) {
+    Message(message, messageSize, deleted.message);
+    SetErr(err, ZARK_PORTMAP_ERR_ROUTER);
+    return -1;
+  }
+  record->Remove(protocol, port);
+  if (!SaveMappingState(environment.statePath, state)) {
+    Message(message, messageSize,
+            "deleted, but the record of our mappings cannot be written");
+    SetErr(err, ZARK_PORTMAP_ERR_IO);
+    return -1;
+  }
+  Message(message, messageSize, "deleted " + what);
+  return 0;
+}
+
+} // namespace
+} // namespace zark::portmap
+
+extern "C" int KLibKeepRouter(const char *gatewayIP, int checkIntervalSeconds,
+                              int *nextSeconds,
                               ZARK_PORTMAP_APPLY_SUMMARY *summary,
                               ZARK_ROUTER_SAVE_RULE_RESULT *result) {
+  using namespace zark::portmap;
+  ZARK_ROUTER_SAVE_RULE_RESULT local{};
+  ZARK_ROUTER_SAVE_RULE_RESULT &out = result != nullptr ? *result : local;
+  out = ZARK_ROUTER_SAVE_RULE_RESULT{};
+  int next = std::max(checkIntervalSeconds, 1);
   if (nextSeconds != nullptr) {
-    *nextSeconds = checkIntervalSeconds > 0 ? checkIntervalSeconds : 1;
+    *nextSeconds = next;
   }
   if (summary != nullptr) {
     *summary = ZARK_PORTMAP_APPLY_SUMMARY{};
   }
-  if (result != nullptr) {
-    *result = ZARK_ROUTER_SAVE_RULE_RESULT{};
-    result->errType = ZARK_PORTMAP_ERR_NOT_IMPLEMENTED;
+  if (gatewayIP == nullptr) {
+    ZARK_PM_LOG_ERROR("KLibKeepRouter: no gateway given");
+    out.errType = kSaveErrBadParameter;
+    return -1;
   }
-  return NotBuiltYet("KLibKeepRouter", nullptr);
+  try {
+    SavedRuleArray saved;
+    if (!ReadSavedRules(saved)) {
+      out.errType = kSaveErrIo;
+      return -1;
+    }
+    ApplySummary done;
+    const int rc = KeepRouter(gatewayIP, saved.Span(), checkIntervalSeconds,
+                              DefaultApplyEnvironment(), out, done, next);
+    if (nextSeconds != nullptr) {
+      *nextSeconds = next;
+    }
+    CopySummary(done, summary);
+    return rc;
+  } catch (const std::exception &e) {
+    // Nothing may cross the C boundary.
+    ZARK_PM_LOG_ERROR("KLibKeepRouter: %s", e.what());
+    out.errType = kSaveErrGeneric;
+    return -1;
+  }
 }
 
-extern "C" int KLibDeleteOurMapping(const char * /*gatewayIP*/,
-                                    const char * /*protocol*/,
-                                    uint16_t /*externalPort*/, char *message,
+extern "C" int KLibDeleteOurMapping(const char *gatewayIP, const char *protocol,
+                                    uint16_t externalPort, char *message,
                                     size_t messageSize,
                                     ZARK_LIBZARKPORTMAP_ERR *err) {
-  if (message != nullptr && messageSize > 0) {
-    std::snprintf(message, messageSize, "not built yet");
+  using namespace zark::portmap;
+  SetErr(err, ZARK_PORTMAP_ERR_NONE);
+  Message(message, messageSize, "");
+  std::optional<IpProtocol> parsed =
+      protocol != nullptr ? ParseProtocolText(protocol) : std::nullopt;
+  if (gatewayIP == nullptr || !parsed) {
+    Message(message, messageSize, "bad gateway or protocol");
+    SetErr(err, ZARK_PORTMAP_ERR_BAD_PARAMETER);
+    return -1;
   }
-  return NotBuiltYet("KLibDeleteOurMapping", err);
+  try {
+    return DeleteOurMapping(gatewayIP, *parsed, externalPort, message,
+                            messageSize, err);
+  } catch (const std::exception &e) {
+    // Nothing may cross the C boundary.
+    ZARK_PM_LOG_ERROR("KLibDeleteOurMapping: %s", e.what());
+    SetErr(err, ZARK_PORTMAP_ERR_GENERIC);
+    return -1;
+  }
 }

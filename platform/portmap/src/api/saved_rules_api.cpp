@@ -1,6 +1,8 @@
-// KLibApplySavedRules: the zarkportforward tool's apply and renewal jobs.
+// KLibApplySavedRules and KLibRepairSavedRules: applying the saved rules as
+// they are (the zarkportforward tool's apply and renewal jobs, a repair).
 #include "zarkportforward.h"
 
+#include "api/saved_rules_access.h"
 #include "apply/save_rules.h"
 #include "base/portmap_log.h"
 
@@ -8,29 +10,8 @@
 #include <memory>
 #include <span>
 
-namespace {
-
-struct RulesArrayDeleter {
-  void operator()(ZARK_ROUTER_RULE *rules) const { KLibFreeRulesArr(rules); }
-};
-
-} // namespace
-
 namespace zark::portmap {
 namespace {
-
-void CopySummary(const ApplySummary &done,
-                 ZARK_PORTMAP_APPLY_SUMMARY *summary) {
-  if (summary == nullptr) {
-    return;
-  }
-  summary->deleted = done.deleted;
-  summary->added = done.added;
-  summary->checked = done.checked;
-  summary->unchanged = done.unchanged;
-  summary->failed = done.failed;
-  summary->repaired = done.repaired;
-}
 
 // Applies the saved rule configuration as it is: the router is asked about
 // every mapping believed held, what it lost is added again, and leases
@@ -52,23 +33,18 @@ int ApplySavedRules(const char *function, const char *gatewayIP,
     out.errType = kSaveErrBadParameter;
     return -1;
   }
-  int count = 0;
-  ZARK_ROUTER_RULE *raw = nullptr;
-  ZARK_LIBZARKPORTMAP_ERR readErr{};
-  if (KLibGetRulesArrFromRuleConf(&count, &raw, nullptr, false, &readErr) < 0) {
+  SavedRuleArray saved;
+  if (!ReadSavedRules(saved)) {
     return ZARK_APPLY_SAVED_RULES_UNREADABLE;
   }
-  std::unique_ptr<ZARK_ROUTER_RULE, RulesArrayDeleter> rules(raw);
   try {
     options.verifyUnchanged = true;
     options.refreshLeases = true;
     options.writeRuleConf = false;
     ApplySummary done;
-    const int rc = ApplyRules(gatewayIP,
-                              std::span<const ZARK_ROUTER_RULE>(
-                                  rules.get(), static_cast<std::size_t>(count)),
-                              options, DefaultApplyEnvironment(), out, callback,
-                              arg, &done);
+    const int rc =
+        ApplyRules(gatewayIP, saved.Span(), options, DefaultApplyEnvironment(),
+                   out, callback, arg, &done);
     CopySummary(done, summary);
     return rc;
   } catch (const std::exception &e) {

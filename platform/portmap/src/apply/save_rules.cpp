@@ -304,7 +304,10 @@ void Applier::Plan(const std::vector<WantedMapping> &wanted) {
     if (!same) {
       step.kind = Step::Kind::kAdd;
     } else if (mOptions.refreshLeases && recorded->expires != 0 &&
-               recorded->expires - now < mEnv.renewAhead.count()) {
+               recorded->expires - now <
+                   (mOptions.renewAtHalfLease
+                        ? static_cast<int64_t>(recorded->leaseSeconds / 2) + 1
+                        : mEnv.renewAhead.count())) {
       step.kind = Step::Kind::kAdd;
       step.refresh = true;
     } else if (mOptions.verifyUnchanged) {

@@ -76,6 +76,9 @@ struct ApplyOptions {
   // The job's name in the record of the last job: "save", "renew",
   // "repair".
   std::string jobKind = "save";
+  // Refresh a lease once half of what the router granted has passed
+  // (instead of renewAhead before its end): the keeper's rule.
+  bool renewAtHalfLease = false;
   // Also ask the router for its outside address (it is always asked when a
   // mapping fails, to tell a double NAT).
   bool askExternalAddress = false;
