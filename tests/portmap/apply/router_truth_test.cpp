@@ -234,6 +234,18 @@ TEST_F(PortMapApplyRouterTruth, AForeignMappingIsLeftAloneAndNamed) {
                 rule["reason"].asString().find("game console"));
     }
   }
+  // The live table marks the foreign mapping as not ours.
+  ZARK_ROUTER_MAPPINGS live{};
+  ZARK_LIBZARKPORTMAP_ERR err{};
+  ASSERT_EQ(0, KLibListRouterMappings(kGateway, &live, &err)) << live.message;
+  ASSERT_EQ(5, live.count);
+  for (int i = 0; i < live.count; ++i) {
+    const ZARK_ROUTER_MAPPING &entry = live.mappings[i];
+    EXPECT_EQ(entry.external_port == 2222 ? 0 : 1, entry.ours)
+        << entry.external_port;
+    EXPECT_EQ(1, entry.enabled);
+  }
+  KLibFreeRouterMappings(&live);
   // A repair tries again and still leaves it alone.
   ZARK_PORTMAP_APPLY_SUMMARY summary{};
   EXPECT_EQ(
