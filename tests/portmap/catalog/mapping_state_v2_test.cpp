@@ -15,8 +15,9 @@ TEST(PortMapCatalogMappingState, ApplyStatesAndTheLastJobRoundTrip) {
   MappingState state;
   RouterRecord &router = state.FindOrAdd("192.168.1.1", RouterProtocol::kUpnp);
   router.externalAddress = "100.64.1.2";
-  router.lastJob = LastJob{"repair", 1700000100, false, 2, 3, 1,
-                           ZARK_FAILURE_CONFLICT, "tcp 8080 is taken"};
+  router.lastJob = LastJob{
+      "repair",           1700000100, false, 2, 3, 1, ZARK_FAILURE_CONFLICT,
+      "tcp 8080 is taken"};
   RecordedMapping refused;
   refused.protocol = IpProtocol::kTcp;
   refused.externalPort = 8080;
@@ -74,7 +75,8 @@ TEST(PortMapCatalogMappingState, VersionTwoNeedsItsMembers) {
   const std::string text =
       "{\"version\":2,\"routers\":[{\"gateway\":\"1.2.3.4\",\"protocol\":"
       "\"upnp\",\"location\":\"\",\"finite_leases\":false,"
-      "\"external_address\":\"\",\"last_job\":null,\"mappings\":[{"
+      "\"external_address\":\"\",\"control_url\":\"\",\"service_type\":"
+      "\"\",\"last_job\":null,\"mappings\":[{"
       "\"protocol\":\"tcp\",\"external_port\":80,\"internal_port\":80,"
       "\"internal_client\":\"1.2.3.5\",\"lease\":0,\"expires\":0,\"held\":"
       "true,\"rule_id\":\"1\",\"failure\":\"\",\"reason\":\"\","

@@ -186,6 +186,8 @@ bool ReadRouter(const Json::Value &value, int version, RouterRecord &router,
   router.protocol = *parsed;
   if (version >= 2) {
     if (!ReadString(value, "external_address", router.externalAddress, why) ||
+        !ReadString(value, "control_url", router.controlUrl, why) ||
+        !ReadString(value, "service_type", router.serviceType, why) ||
         !ReadLastJob(value["last_job"], router.lastJob, why)) {
       return false;
     }
@@ -341,6 +343,8 @@ std::string SerializeMappingState(const MappingState &state) {
     item["location"] = router.location;
     item["finite_leases"] = router.finiteLeases;
     item["external_address"] = router.externalAddress;
+    item["control_url"] = router.controlUrl;
+    item["service_type"] = router.serviceType;
     if (router.lastJob) {
       const LastJob &job = *router.lastJob;
       Json::Value last(Json::objectValue);

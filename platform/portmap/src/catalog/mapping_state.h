@@ -11,6 +11,8 @@
 //       "gateway" : "192.168.1.1", "protocol" : "upnp",
 //       "location" : "http://192.168.1.1:5000/rootDesc.xml",
 //       "finite_leases" : false, "external_address" : "203.0.113.7",
+//       "control_url" : "http://192.168.1.1:5000/ctl/IPConn",
+//       "service_type" : "urn:schemas-upnp-org:service:WANIPConnection:2",
 //       "last_job" : { "kind" : "save", "ended" : 1700000000, "ok" : false,
 //                      "repaired" : 0, "added" : 1, "deleted" : 0,
 //                      "failure" : "conflict", "reason" : "words" },
@@ -21,10 +23,12 @@
 //         "failure" : "", "reason" : "", "verified" : 1700000000 } ] } ]
 //   }
 //
-// "last_job" may be null. Version 1 files (without "external_address",
-// "last_job" and the mappings' "state", "failure", "reason", "verified")
-// are read too: a held mapping is then "on_router", another "pending", and
-// none was verified.
+// "control_url" and "service_type" are where the last job sent its UPnP
+// requests: the next one starts there without fetching the description
+// ("" for NAT-PMP). "last_job" may be null. Version 1 files (without
+// "external_address", "last_job" and the mappings' "state", "failure",
+// "reason", "verified") are read too: a held mapping is then "on_router",
+// another "pending", and none was verified.
 //
 // "held" true: the router was seen to hold the mapping. false: it may or may
 // not (a request was under way when the job stopped, or the router stopped
@@ -100,6 +104,8 @@ struct RouterRecord {
   std::string location;                            // RouterDriver::Location()
   bool finiteLeases = false;
   std::string externalAddress; // "" unknown
+  std::string controlUrl;      // RouterDriver::ControlUrl()
+  std::string serviceType;     // RouterDriver::ServiceType()
   std::optional<LastJob> lastJob;
   std::vector<RecordedMapping> mappings;
 
