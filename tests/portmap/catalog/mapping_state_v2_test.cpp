@@ -93,5 +93,38 @@ TEST(PortMapCatalogMappingState, VersionTwoNeedsItsMembers) {
   EXPECT_NE(std::string::npos, why.find("gremlins"));
 }
 
+TEST(PortMapCatalogMappingState, LookupsFollowPutsRemovesAndDirectChanges) {
+  RouterRecord router;
+  for (uint16_t port = 1; port <= 2000; ++port) {
+    RecordedMapping mapping;
+    mapping.protocol = port % 2 == 0 ? IpProtocol::kTcp : IpProtocol::kUdp;
+    mapping.externalPort = port;
+    mapping.internalPort = port;
+    mapping.internalClient = "10.0.0.2";
+    router.Put(mapping);
+  }
+  ASSERT_EQ(2000u, router.mappings.size());
+  ASSERT_NE(nullptr, router.Find(IpProtocol::kTcp, 1000));
+  EXPECT_EQ(nullptr, router.Find(IpProtocol::kUdp, 1000));
+  router.Remove(IpProtocol::kTcp, 2);
+  EXPECT_EQ(nullptr, router.Find(IpProtocol::kTcp, 2));
+  const RecordedMapping *last = router.Find(IpProtocol::kTcp, 2000);
+  ASSERT_NE(nullptr, last);
+  EXPECT_EQ(2000, last->externalPort);
+  // A change made to the list itself is seen too.
+  router.mappings.pop_back();
+  RecordedMapping added;
+  added.protocol = IpProtocol::kUdp;
+  added.externalPort = 4000;
+  router.mappings.push_back(added);
+  EXPECT_EQ(nullptr, router.Find(IpProtocol::kTcp, 2000));
+  ASSERT_NE(nullptr, router.Find(IpProtocol::kUdp, 4000));
+  // Putting an existing port replaces it in place.
+  added.internalPort = 7;
+  router.Put(added);
+  EXPECT_EQ(1999u, router.mappings.size());
+  EXPECT_EQ(7, router.Find(IpProtocol::kUdp, 4000)->internalPort);
+}
+
 } // namespace
 } // namespace zark::portmap

@@ -53,6 +53,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 #include <vector>
 
 namespace zark::portmap {
@@ -109,9 +110,17 @@ struct RouterRecord {
   std::optional<LastJob> lastJob;
   std::vector<RecordedMapping> mappings;
 
-  friend bool operator==(const RouterRecord &, const RouterRecord &) = default;
+  // Equal content; the lookup index is not content.
+  friend bool operator==(const RouterRecord &a, const RouterRecord &b) {
+    return a.gateway == b.gateway && a.protocol == b.protocol &&
+           a.location == b.location && a.finiteLeases == b.finiteLeases &&
+           a.externalAddress == b.externalAddress &&
+           a.controlUrl == b.controlUrl && a.serviceType == b.serviceType &&
+           a.lastJob == b.lastJob && a.mappings == b.mappings;
+  }
 
-  // The mapping of externalPort/protocol, or null.
+  // The mapping of externalPort/protocol, or null. Keyed (not a search of
+  // the list): a save of many mappings looks each up several times.
   [[nodiscard]] RecordedMapping *Find(IpProtocol protocol,
                                       uint16_t externalPort);
   [[nodiscard]] const RecordedMapping *Find(IpProtocol protocol,
@@ -120,6 +129,13 @@ struct RouterRecord {
   void Put(const RecordedMapping &mapping);
   // Removes the mapping of externalPort/protocol, if any.
   void Remove(IpProtocol protocol, uint16_t externalPort);
+
+private:
+  // Position in mappings by protocol and port, rebuilt when it no longer
+  // matches the list (a caller may change the list directly).
+  [[nodiscard]] std::size_t IndexOf(IpProtocol protocol,
+                                    uint16_t externalPort) const;
+  mutable std::unordered_map<uint32_t, std::size_t> mIndex;
 };
 
 struct MappingState {
