@@ -126,5 +126,35 @@ TEST(PortMapCatalogMappingState, LookupsFollowPutsRemovesAndDirectChanges) {
   EXPECT_EQ(7, router.Find(IpProtocol::kUdp, 4000)->internalPort);
 }
 
+TEST(PortMapCatalogMappingState, TheFileCapHoldsEveryPortOfBothProtocols) {
+  // A sample of 1000 refused mappings with long rule ids and reasons; the
+  // whole state grows linearly from it.
+  constexpr std::size_t kSample = 1000;
+  MappingState state;
+  RouterRecord &router = state.FindOrAdd("192.168.1.1", RouterProtocol::kUpnp);
+  router.location = "http://192.168.1.1:5000/rootDesc.xml";
+  for (std::size_t i = 0; i < kSample; ++i) {
+    RecordedMapping mapping;
+    mapping.protocol = IpProtocol::kTcp;
+    mapping.externalPort = static_cast<uint16_t>(60000 + i);
+    mapping.internalPort = mapping.externalPort;
+    mapping.internalClient = "192.168.100.200";
+    mapping.leaseSeconds = 4294967295u;
+    mapping.expires = 9999999999;
+    mapping.verified = 9999999999;
+    mapping.ruleId = std::string(200, 'r');
+    mapping.apply = MappingApply::kRefused;
+    mapping.failure = ZARK_FAILURE_ROUTER_NOT_ANSWERING;
+    mapping.reason = std::string(200, 'w');
+    router.Put(mapping);
+  }
+  const std::size_t sampleBytes = SerializeMappingState(state).size();
+  const std::size_t wholeBytes =
+      sampleBytes / kSample * kMaxRecordedMappings + sampleBytes % kSample;
+  EXPECT_LT(wholeBytes, kMaxMappingStateBytes)
+      << sampleBytes << " bytes for " << kSample << " mappings";
+  EXPECT_EQ(2u * 65535u, kMaxRecordedMappings);
+}
+
 } // namespace
 } // namespace zark::portmap

@@ -15,10 +15,8 @@
 namespace zark::portmap {
 namespace {
 
-// Every port of both protocols on one router, each entry written with its
-// longest rule id and reason (about 600 bytes pretty-printed), fits.
-constexpr Json::ArrayIndex kMaxMappings = 2 * 65535;
-constexpr std::size_t kMaxStateBytes = 128u << 20;
+constexpr Json::ArrayIndex kMaxMappings = kMaxRecordedMappings;
+constexpr std::size_t kMaxStateBytes = kMaxMappingStateBytes;
 constexpr Json::ArrayIndex kMaxRouters = 64;
 
 constexpr MappingApply kApplyStates[] = {

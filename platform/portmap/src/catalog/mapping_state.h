@@ -61,6 +61,13 @@ namespace zark::portmap {
 inline constexpr const char *kMappingStatePath =
     ZARK_PORTMAP_CONF_DIR "/mappings.json";
 inline constexpr int kMappingStateVersion = 2;
+// The most mappings one router's record holds: every port of both
+// protocols, the largest rule set the library accepts.
+inline constexpr std::size_t kMaxRecordedMappings = 2 * 65535;
+// The largest state file read: the most mappings of one router, each with
+// a rule id and a reason of 200 bytes, fit (about 825 bytes an entry as
+// written).
+inline constexpr std::size_t kMaxMappingStateBytes = 128u << 20;
 
 // Where a wanted mapping stands with the router.
 enum class MappingApply : uint8_t { kOnRouter, kMissing, kRefused, kPending };
