@@ -185,9 +185,14 @@ RouterResult UpnpRouter::Open() {
       mOptions.localNetworks ? *mOptions.localNetworks : InterfaceNetworks();
   mGateway = ParseIpv4(mOptions.gateway);
 
+  // Only a control point on the local network, as a fresh description's
+  // would have to be (ServicesOnLocalNetwork): the state file is no proof.
   if (!mMemoTried && !mOptions.knownControlUrl.empty() &&
       !mOptions.knownServiceType.empty() &&
-      !mOptions.knownRootDescUrls.empty()) {
+      !mOptions.knownRootDescUrls.empty() &&
+      IsUrlOnLocalNetwork(mOptions.knownRootDescUrls.front(), mNetworks,
+                          mGateway) &&
+      IsUrlOnLocalNetwork(mOptions.knownControlUrl, mNetworks, mGateway)) {
     // The control point the last job used: no description fetch. A request
     // that fails through it fetches the description again
     // (ControlUrlWasStale).
