@@ -3,7 +3,16 @@
 #include "base/portmap_log.h"
 #include "drivers/driver_log.h"
 
+// The miniupnpc library is built as C99, where UNSIGNED_INTEGER is unsigned
+// long long. A C++ compiler defines no __STDC_VERSION__, so the header would
+// make it unsigned int and read struct PortMapping (its leaseTime, and every
+// field after it) at the wrong offsets: every listed entry came out empty.
+#include <miniupnpc/miniupnpctypes.h>
+#undef UNSIGNED_INTEGER
+#define UNSIGNED_INTEGER unsigned long long
+
 #include <miniupnpc/miniupnpc.h>
+#include <miniupnpc/portlistingparse.h>
 #include <miniupnpc/upnpcommands.h>
 #include <miniupnpc/upnperrors.h>
 #include <syslog.h>
@@ -175,6 +184,31 @@ RouterResult UpnpRouter::Open() {
   mNetworks =
       mOptions.localNetworks ? *mOptions.localNetworks : InterfaceNetworks();
   mGateway = ParseIpv4(mOptions.gateway);
+
+  // Only a control point on the local network, as a fresh description's
+  // would have to be (ServicesOnLocalNetwork): the state file is no proof.
+  if (!mMemoTried && !mOptions.knownControlUrl.empty() &&
+      !mOptions.knownServiceType.empty() &&
+      !mOptions.knownRootDescUrls.empty() &&
+      IsUrlOnLocalNetwork(mOptions.knownRootDescUrls.front(), mNetworks,
+                          mGateway) &&
+      IsUrlOnLocalNetwork(mOptions.knownControlUrl, mNetworks, mGateway)) {
+    // The control point the last job used: no description fetch. A request
+    // that fails through it fetches the description again
+    // (ControlUrlWasStale).
+    mMemoTried = true;
+    mFromMemo = true;
+    mRootDescUrl = mOptions.knownRootDescUrls.front();
+    mControlUrl = mOptions.knownControlUrl;
+    mServiceType = mOptions.knownServiceType;
+    mOpen = true;
+    RouterResult remembered;
+    remembered.outcome = RouterOutcome::kOk;
+    remembered.message =
+        "using " + mServiceType + " at " + mControlUrl + " (remembered)";
+    return remembered;
+  }
+  mMemoTried = true;
 
   RouterResult last;
   last.outcome = RouterOutcome::kNoRouter;
@@ -376,7 +410,7 @@ RouterResult UpnpRouter::TryRootDescription(const std::string &url) {
   return result;
 }
 
-RouterResult UpnpRouter::AddPortMapping(const PortMapping &mapping) {
+RouterResult UpnpRouter::SendAddOnce(const PortMapping &mapping) {
   RouterResult opened = Open();
   if (!opened.Ok()) {
     return opened;
@@ -407,10 +441,33 @@ RouterResult UpnpRouter::AddPortMapping(const PortMapping &mapping) {
     }
     return added;
   }
+  if (added.Ok()) {
+    mLeaseKind = kind;
+  }
+  return added;
+}
+
+bool UpnpRouter::CanListRanges() const {
+  // WANIPConnection:2 and later have GetListOfPortMappings.
+  return mServiceType.size() > 2 &&
+         mServiceType.compare(mServiceType.size() - 2, 2, ":1") != 0;
+}
+
+RouterResult UpnpRouter::AddPortMappingUnconfirmed(const PortMapping &mapping) {
+  RouterResult opened = Open();
+  if (!opened.Ok()) {
+    return opened;
+  }
+  return CanListRanges() ? SendAdd(mapping) : AddPortMapping(mapping);
+}
+
+RouterResult UpnpRouter::AddPortMapping(const PortMapping &mapping) {
+  RouterResult added = SendAdd(mapping);
   if (!added.Ok()) {
     return added;
   }
-  mLeaseKind = kind;
+  const std::string external = std::to_string(mapping.externalPort);
+  const char *protocol = UpnpProtocolName(mapping.protocol);
 
   // Some routers answer success and drop the mapping (a full table), or
   // answer with a body that miniupnpc reads as success: look.
@@ -452,7 +509,7 @@ RouterResult UpnpRouter::AddPortMapping(const PortMapping &mapping) {
   return confirm;
 }
 
-RouterResult UpnpRouter::DeletePortMapping(const PortMapping &mapping) {
+RouterResult UpnpRouter::DeletePortMappingOnce(const PortMapping &mapping) {
   RouterResult opened = Open();
   if (!opened.Ok()) {
     return opened;
@@ -464,9 +521,9 @@ RouterResult UpnpRouter::DeletePortMapping(const PortMapping &mapping) {
   return ZARK_PM_CLASSIFY("UPNP_DeletePortMapping", rc, MappingText(mapping));
 }
 
-RouterResult UpnpRouter::GetSpecificPortMapping(IpProtocol protocol,
-                                                uint16_t externalPort,
-                                                RouterMapping &entry) {
+RouterResult UpnpRouter::GetSpecificPortMappingOnce(IpProtocol protocol,
+                                                    uint16_t externalPort,
+                                                    RouterMapping &entry) {
   RouterResult opened = Open();
   if (!opened.Ok()) {
     return opened;
@@ -512,7 +569,7 @@ RouterResult UpnpRouter::GetSpecificPortMapping(IpProtocol protocol,
   return result;
 }
 
-RouterResult UpnpRouter::ListMappings(std::vector<RouterMapping> &entries) {
+RouterResult UpnpRouter::ListMappingsOnce(std::vector<RouterMapping> &entries) {
   RouterResult opened = Open();
   if (!opened.Ok()) {
     return opened;
@@ -575,7 +632,105 @@ RouterResult UpnpRouter::ListMappings(std::vector<RouterMapping> &entries) {
   return capped;
 }
 
-RouterResult UpnpRouter::GetExternalAddress(std::string &address) {
+ZARK_FAILURE_KIND UpnpRouter::FailureKind(const RouterResult &result) const {
+  switch (result.code) {
+  case kUpnpConflictInMappingEntry:
+  case kUpnpConflictWithOtherMechanisms:
+    return ZARK_FAILURE_CONFLICT;
+  case kUpnpNoPortMapsAvailable:
+    return ZARK_FAILURE_TABLE_FULL;
+  case kUpnpOnlyPermanentLeases:
+    return ZARK_FAILURE_LEASE_REFUSED;
+  case kUpnpNotAuthorized:
+  case kUpnpSamePortValuesRequired:
+  case kUpnpWildcardExternalPort:
+    return ZARK_FAILURE_PORT_REFUSED;
+  default:
+    return RouterDriver::FailureKind(result);
+  }
+}
+
+static_assert(sizeof(::PortMapping::leaseTime) == sizeof(unsigned long long),
+              "miniupnpc's listing entries must be read with its C99 layout");
+
+RouterResult
+UpnpRouter::ListPortRangeOnce(IpProtocol protocol, uint16_t firstPort,
+                              uint16_t lastPort,
+                              std::vector<RouterMapping> &entries) {
+  entries.clear();
+  RouterResult opened = Open();
+  if (!opened.Ok()) {
+    return opened;
+  }
+  if (!CanListRanges()) {
+    return RouterDriver::ListPortRange(protocol, firstPort, lastPort, entries);
+  }
+  // One page per request; a router sends at most the number asked (and
+  // miniupnpd at most 1000 whatever is asked), so a full page asks again
+  // from the port after its last entry. Bounded: 65536 ports, 1000 a page.
+  constexpr int kPageEntries = 1000;
+  const std::string page = std::to_string(kPageEntries);
+  uint32_t start = firstPort;
+  RouterResult result;
+  for (int request = 0; request < 66 && start <= lastPort; ++request) {
+    const std::string startText = std::to_string(start);
+    const std::string endText = std::to_string(lastPort);
+    PortMappingParserData data{};
+    int rc = UPNP_GetListOfPortMappings(
+        mControlUrl.c_str(), mServiceType.c_str(), startText.c_str(),
+        endText.c_str(), UpnpProtocolName(protocol), page.c_str(), &data);
+    std::unique_ptr<PortMappingParserData, void (*)(PortMappingParserData *)>
+        owner(&data, FreePortListing);
+    if (rc == kUpnpPortMappingNotFound) {
+      LogRouterCall(__FILE__, __LINE__, "UPNP_GetListOfPortMappings", rc, false,
+                    "", startText + "-" + endText + ": no more mappings");
+      break;
+    }
+    result = ZARK_PM_CLASSIFY("UPNP_GetListOfPortMappings", rc,
+                              std::string(UpnpProtocolName(protocol)) + " " +
+                                  startText + "-" + endText);
+    if (!result.Ok()) {
+      entries.clear();
+      return result;
+    }
+    int count = 0;
+    uint32_t highest = 0;
+    for (const ::PortMapping *item = data.l_head; item != nullptr;
+         item = item->l_next) {
+      ++count;
+      std::optional<IpProtocol> itemProtocol =
+          ParseProtocolText(item->protocol);
+      if (!itemProtocol || *itemProtocol != protocol ||
+          item->externalPort == 0 || item->externalPort < start) {
+        continue;
+      }
+      RouterMapping entry;
+      entry.protocol = protocol;
+      entry.externalPort = item->externalPort;
+      entry.internalPort = item->internalPort;
+      entry.internalClient = item->internalClient;
+      entry.description = item->description;
+      entry.leaseSeconds = static_cast<uint32_t>(item->leaseTime);
+      entry.enabled = item->enabled != 0;
+      highest = std::max<uint32_t>(highest, item->externalPort);
+      entries.push_back(std::move(entry));
+    }
+    if (count < kPageEntries || highest == 0) {
+      break;
+    }
+    start = highest + 1;
+  }
+  std::sort(entries.begin(), entries.end(),
+            [](const RouterMapping &a, const RouterMapping &b) {
+              return a.externalPort < b.externalPort;
+            });
+  result.outcome = RouterOutcome::kOk;
+  result.code = 0;
+  result.message = std::to_string(entries.size()) + " mapping(s) listed";
+  return result;
+}
+
+RouterResult UpnpRouter::GetExternalAddressOnce(std::string &address) {
   RouterResult opened = Open();
   if (!opened.Ok()) {
     return opened;
@@ -597,6 +752,67 @@ RouterResult UpnpRouter::GetExternalAddress(std::string &address) {
   }
   address = text;
   return result;
+}
+
+bool UpnpRouter::ControlUrlWasStale(const RouterResult &failed) {
+  const bool mayBeStale = failed.outcome == RouterOutcome::kNoAnswer ||
+                          failed.outcome == RouterOutcome::kBadReply ||
+                          failed.code == UPNPCOMMAND_HTTP_ERROR ||
+                          failed.code == kUpnpInvalidAction;
+  if (!mFromMemo || failed.Ok() || !mayBeStale) {
+    return false;
+  }
+  // The remembered control URL failed: the router may have restarted on
+  // another port or path. Fetch its description once; retry only when it
+  // names another control point.
+  mFromMemo = false;
+  mOpen = false;
+  const std::string oldUrl = mControlUrl;
+  const std::string oldType = mServiceType;
+  if (!Open().Ok()) {
+    return false;
+  }
+  return mControlUrl != oldUrl || mServiceType != oldType;
+}
+
+RouterResult UpnpRouter::SendAdd(const PortMapping &mapping) {
+  RouterResult result = SendAddOnce(mapping);
+  return ControlUrlWasStale(result) ? SendAddOnce(mapping) : result;
+}
+
+RouterResult UpnpRouter::DeletePortMapping(const PortMapping &mapping) {
+  RouterResult result = DeletePortMappingOnce(mapping);
+  return ControlUrlWasStale(result) ? DeletePortMappingOnce(mapping) : result;
+}
+
+RouterResult UpnpRouter::GetSpecificPortMapping(IpProtocol protocol,
+                                                uint16_t externalPort,
+                                                RouterMapping &entry) {
+  RouterResult result =
+      GetSpecificPortMappingOnce(protocol, externalPort, entry);
+  return ControlUrlWasStale(result)
+             ? GetSpecificPortMappingOnce(protocol, externalPort, entry)
+             : result;
+}
+
+RouterResult UpnpRouter::ListMappings(std::vector<RouterMapping> &entries) {
+  RouterResult result = ListMappingsOnce(entries);
+  return ControlUrlWasStale(result) ? ListMappingsOnce(entries) : result;
+}
+
+RouterResult UpnpRouter::ListPortRange(IpProtocol protocol, uint16_t firstPort,
+                                       uint16_t lastPort,
+                                       std::vector<RouterMapping> &entries) {
+  RouterResult result =
+      ListPortRangeOnce(protocol, firstPort, lastPort, entries);
+  return ControlUrlWasStale(result)
+             ? ListPortRangeOnce(protocol, firstPort, lastPort, entries)
+             : result;
+}
+
+RouterResult UpnpRouter::GetExternalAddress(std::string &address) {
+  RouterResult result = GetExternalAddressOnce(address);
+  return ControlUrlWasStale(result) ? GetExternalAddressOnce(address) : result;
 }
 
 } // namespace zark::portmap
