@@ -112,6 +112,7 @@ OptionsResult ParseHostOptions(std::span<const std::string> args,
     kSessionIdle,
     kSessionMax,
     kSecureCookie,
+    kKeeperInterval,
   };
   static const option kOptions[] = {
       {"help", no_argument, nullptr, 'h'},
@@ -123,6 +124,7 @@ OptionsResult ParseHostOptions(std::span<const std::string> args,
       {"session-idle", required_argument, nullptr, kSessionIdle},
       {"session-max", required_argument, nullptr, kSessionMax},
       {"secure-cookie", no_argument, nullptr, kSecureCookie},
+      {"keeper-interval", required_argument, nullptr, kKeeperInterval},
       {nullptr, 0, nullptr, 0},
   };
   ArgumentVector arguments("zark-webapid", args);
@@ -199,6 +201,15 @@ OptionsResult ParseHostOptions(std::span<const std::string> args,
       options.sessions.maxLifetime = *max;
       break;
     }
+    case kKeeperInterval: {
+      auto interval = seconds(kMaxKeeperIntervalSeconds);
+      if (!interval) {
+        return OptionsResult::Error;
+      }
+      options.modules.keeper_interval_seconds =
+          static_cast<std::int32_t>(interval->count() / 1000);
+      break;
+    }
     default:
       error = "unknown option " + RefusedOption(got, argv);
       return OptionsResult::Error;
@@ -236,6 +247,9 @@ std::string HostUsage(std::string_view program) {
          "case (default 43200)\n"
          "  --secure-cookie        mark the session cookie Secure (when "
          "served over HTTPS)\n"
+         "  --keeper-interval SECONDS  how often modules check the router "
+         "for lost\n"
+         "                         mappings, 1 to 86400 (default 300)\n"
          "  --help                 this text\n"
          "\n"
          "passwd reads the password from standard input (twice, without "
