@@ -1,7 +1,7 @@
 // The keeper under the host: started by the host's start of the module,
 // rounds under the port-map lock at the library's pace, bounded and
 // interruptible stop, what it logs.
-#include "status_host_fixture.h"
+#include "fake_status_host.h"
 
 #include "syslog_capture.h"
 
@@ -19,7 +19,7 @@ using zark::fake::Calls;
 using zark::fake::CountCalls;
 using zark::fake::Fake;
 
-class KeeperUnderHost : public StatusHost {};
+class KeeperUnderHost : public FakeStatusHost {};
 
 TEST_F(KeeperUnderHost, StartsWithTheHostAndRoundsEveryInterval) {
   StartHost(1);

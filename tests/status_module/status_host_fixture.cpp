@@ -14,16 +14,14 @@ using zark::host::test::FormEncode;
 void StatusHost::SetUp() {
   zark::test::ResetFixedPaths();
   zark::host::test::WriteStandardAccounts();
-  zark::fake::Reset();
 }
 
-void StatusHost::StartHost(int keeperIntervalSeconds) {
+void StatusHost::StartHost(const fs::path &module, int keeperIntervalSeconds) {
   using namespace zark::host;
   const fs::path folder = "/tmp/status-modules";
   fs::remove_all(folder);
   fs::create_directories(folder);
-  fs::copy_file(STATUS_TEST_MODULE,
-                folder / fs::path(STATUS_TEST_MODULE).filename());
+  fs::copy_file(module, folder / module.filename());
   mModules = std::make_unique<ModuleRegistry>();
   ASSERT_EQ(mModules->LoadFolder(folder), 1u);
   ZARK_MODULE_SETTINGS settings = DefaultModuleSettings();
@@ -153,18 +151,6 @@ StatusHost::PollUntil(const std::string &method, const std::string &extra,
 int Code(const Json::Value &answer) {
   EXPECT_FALSE(answer["success"].asBool()) << answer;
   return answer["error"]["code"].asInt();
-}
-
-bool WaitForCalls(const std::string &name, std::size_t count,
-                  std::chrono::milliseconds limit) {
-  const auto deadline = std::chrono::steady_clock::now() + limit;
-  while (zark::fake::CountCalls(name) < count) {
-    if (std::chrono::steady_clock::now() >= deadline) {
-      return false;
-    }
-    std::this_thread::sleep_for(10ms);
-  }
-  return true;
 }
 
 } // namespace zark::status::test

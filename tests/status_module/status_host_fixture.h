@@ -1,13 +1,12 @@
-// A whole host in the test process, serving the status module (built
-// against the fake port-map library) over HTTP on 127.0.0.1: the module
-// registry, sessions, logins, the request handler and the HTTP server, as
-// zark-webapid puts them together. The test sets the fake up, then starts
-// the host; the host's start starts the module's keeper.
+// A whole host in the test process, serving the status module over HTTP on
+// 127.0.0.1: the module registry, sessions, logins, the request handler and
+// the HTTP server, as zark-webapid puts them together. The test prepares
+// the port-map library (the fake, or the real one in a test network), then
+// starts the host; the host's start starts the module's keeper.
 #ifndef ZARK_TESTS_STATUS_HOST_FIXTURE_H
 #define ZARK_TESTS_STATUS_HOST_FIXTURE_H
 
 #include "clock.h"
-#include "fake_portmap.h"
 #include "host_test_support.h"
 #include "http_server.h"
 #include "login_service.h"
@@ -22,6 +21,7 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
+#include <filesystem>
 #include <functional>
 #include <memory>
 #include <string>
@@ -42,8 +42,10 @@ protected:
   void SetUp() override;
   void TearDown() override;
 
-  // Loads the module, starts it with this check interval and serves.
-  void StartHost(int keeperIntervalSeconds = 300);
+  // Loads the module (a copy of the built file), starts it with this check
+  // interval and serves; logs the administrator in.
+  void StartHost(const std::filesystem::path &module,
+                 int keeperIntervalSeconds);
   // Stops serving and stops the modules (the keeper), as the host's
   // shutdown does; returns how long the module stop took.
   std::chrono::milliseconds StopHost();
@@ -74,10 +76,6 @@ protected:
 
 // The error code of a failed answer (a test failure when it succeeded).
 int Code(const Json::Value &answer);
-
-// Waits, bounded, until the fake saw at least count calls of name.
-bool WaitForCalls(const std::string &name, std::size_t count,
-                  std::chrono::milliseconds limit);
 
 } // namespace zark::status::test
 

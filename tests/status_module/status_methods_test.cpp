@@ -2,7 +2,7 @@
 // from the port-map library (the fake), the lock taken around every router
 // conversation, the errors in words, and the host's refusals of callers
 // that are not logged-in administrators.
-#include "status_host_fixture.h"
+#include "fake_status_host.h"
 
 #include "syslog_capture.h"
 
@@ -60,10 +60,10 @@ size_t LibraryCalls() {
          CountCalls("KLibRepairSavedRules");
 }
 
-class StatusMethods : public StatusHost {
+class StatusMethods : public FakeStatusHost {
 protected:
   void SetUp() override {
-    StatusHost::SetUp();
+    FakeStatusHost::SetUp();
     // The keeper waits out its interval after its first round, so that
     // only the method under test talks to the fake.
     StartHost(3600);
