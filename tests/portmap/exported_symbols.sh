@@ -31,9 +31,15 @@ if [ "${#exported[@]}" -eq 0 ]; then
   exit 1
 fi
 
+# Lists as text, searched from here-strings: "printf | grep -q" fails now and
+# then under pipefail, when grep stops reading at its first match and printf
+# dies of SIGPIPE.
+declared_text=$(printf '%s\n' "${declared[@]}")
+exported_text=$(printf '%s\n' "${exported[@]}")
+
 failed=0
 for symbol in "${exported[@]}"; do
-  if printf '%s\n' "${declared[@]}" | grep -qxF "$symbol"; then
+  if grep -qxF "$symbol" <<<"$declared_text"; then
     continue
   fi
   demangled=$(c++filt "$symbol")
@@ -49,13 +55,13 @@ for symbol in "${exported[@]}"; do
   fi
 done
 for function in "${declared[@]}"; do
-  if ! printf '%s\n' "${exported[@]}" | grep -qxF "$function"; then
+  if ! grep -qxF "$function" <<<"$exported_text"; then
     echo "declared but not exported: $function" >&2
     failed=1
   fi
 done
 for class in "${classes[@]}"; do
-  if ! printf '%s\n' "${exported[@]}" | c++filt | grep -q "^$class::"; then
+  if ! c++filt <<<"$exported_text" | grep "^$class::" >/dev/null; then
     echo "class $class declared but none of its members exported" >&2
     failed=1
   fi

@@ -379,6 +379,48 @@ HttpReply FakeIgd::BuiltIn(const SoapRequest &request) {
          {"NewPortMappingDescription", entry.description},
          {"NewLeaseDuration", std::to_string(entry.lease)}});
   }
+  if (request.action == "GetListOfPortMappings" &&
+      mVariant == IgdVariant::kIpV2Only) {
+    // IGD:2's listing of a port range: the entries as an XML document in
+    // NewPortListing, sent as CDATA (as miniupnpd sends it).
+    const uint16_t first = port("NewStartPort");
+    const uint16_t last = port("NewEndPort");
+    std::size_t most =
+        std::strtoul(request.Arg("NewNumberOfPorts").c_str(), nullptr, 10);
+    std::vector<Entry> listed;
+    for (const Entry &entry : mTable) {
+      if (entry.protocol == request.Arg("NewProtocol") &&
+          entry.externalPort >= first && entry.externalPort <= last) {
+        listed.push_back(entry);
+      }
+    }
+    std::sort(listed.begin(), listed.end(), [](const Entry &a, const Entry &b) {
+      return a.externalPort < b.externalPort;
+    });
+    listed.resize(std::min(listed.size(), most == 0 ? 1000 : most));
+    if (listed.empty()) {
+      return SoapFault(730, "PortMappingNotFound");
+    }
+    std::string list = "<p:PortMappingList "
+                       "xmlns:p=\"urn:schemas-upnp-org:gw:WANIPConnection\">";
+    for (const Entry &entry : listed) {
+      list += "<p:PortMappingEntry><p:NewRemoteHost></p:NewRemoteHost>"
+              "<p:NewExternalPort>" +
+              std::to_string(entry.externalPort) +
+              "</p:NewExternalPort><p:NewProtocol>" + entry.protocol +
+              "</p:NewProtocol><p:NewInternalPort>" +
+              std::to_string(entry.internalPort) +
+              "</p:NewInternalPort><p:NewInternalClient>" + entry.client +
+              "</p:NewInternalClient><p:NewEnabled>1</p:NewEnabled>"
+              "<p:NewDescription>" +
+              entry.description + "</p:NewDescription><p:NewLeaseTime>" +
+              std::to_string(entry.lease) +
+              "</p:NewLeaseTime></p:PortMappingEntry>";
+    }
+    list += "</p:PortMappingList>";
+    return SoapResponse(type, request.action,
+                        {{"NewPortListing", "<![CDATA[" + list + "]]>"}});
+  }
   if (request.action == "GetExternalIPAddress") {
     return SoapResponse(type, request.action,
                         {{"NewExternalIPAddress", "198.51.100.7"}});
@@ -435,6 +477,9 @@ HttpReply FakeIgd::Answer(const std::string &method, const std::string &path,
       "NewPortMappingDescription",
       "NewLeaseDuration",
       "NewPortMappingIndex",
+      "NewStartPort",
+      "NewEndPort",
+      "NewNumberOfPorts",
   };
   for (const char *name : kArgs) {
     if (std::optional<std::string> value = Element(body, name)) {

@@ -51,7 +51,8 @@ enum class IgdVariant {
   kIpAndPppV1, // IGD:1 with WANPPPConnection:1 listed first, then
                // WANIPConnection:1
   kPppOnlyV1,  // IGD:1 with WANPPPConnection:1 only
-  kIpV2Only,   // IGD:2 with WANIPConnection:2 only
+  kIpV2Only,   // IGD:2 with WANIPConnection:2 only; answers
+               // GetListOfPortMappings
 };
 
 class FakeIgd {

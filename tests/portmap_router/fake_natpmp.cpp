@@ -108,6 +108,11 @@ std::vector<FakeNatPmp::Mapping> FakeNatPmp::Table() const {
   return mTable;
 }
 
+void FakeNatPmp::SetGrantedLifetime(std::optional<uint32_t> seconds) {
+  std::lock_guard<std::mutex> lock(mMutex);
+  mGrantedLifetime = seconds;
+}
+
 std::vector<uint8_t> FakeNatPmp::BuiltIn(const NatPmpRequest &request) {
   // Called with mMutex held.
   if (request.opcode == 0) {
@@ -132,9 +137,13 @@ std::vector<uint8_t> FakeNatPmp::BuiltIn(const NatPmpRequest &request) {
     }
     return MappingReply(request.opcode, 0, request.privatePort, 0, 0);
   }
+  // A router may grant less than asked (some grant two minutes).
+  const uint32_t granted = mGrantedLifetime
+                               ? std::min(*mGrantedLifetime, request.lifetime)
+                               : request.lifetime;
   if (mine != mTable.end()) {
     // A mapping of this private port exists: it is renewed as it is.
-    mine->lifetime = request.lifetime;
+    mine->lifetime = granted;
     return MappingReply(request.opcode, 0, mine->privatePort, mine->publicPort,
                         mine->lifetime);
   }
@@ -152,7 +161,7 @@ std::vector<uint8_t> FakeNatPmp::BuiltIn(const NatPmpRequest &request) {
   for (int tries = 0; tries < 1000 && taken(port); ++tries) {
     port = static_cast<uint16_t>(port + 1);
   }
-  Mapping added{request.opcode, request.privatePort, port, request.lifetime};
+  Mapping added{request.opcode, request.privatePort, port, granted};
   mTable.push_back(added);
   return MappingReply(request.opcode, 0, added.privatePort, added.publicPort,
                       added.lifetime);

@@ -46,6 +46,8 @@ public:
   void SetSilent(bool silent);
   // A public port some other device holds: the router gives another one.
   void TakePublicPort(uint8_t opcode, uint16_t port);
+  // Grants at most this lifetime to a mapping (nothing: what was asked).
+  void SetGrantedLifetime(std::optional<uint32_t> seconds);
 
   int Requests() const;
   std::vector<NatPmpRequest> ReceivedRequests() const;
@@ -73,6 +75,7 @@ private:
   std::vector<Mapping> mTable;
   std::vector<std::pair<uint8_t, uint16_t>> mTaken;
   std::vector<NatPmpRequest> mRequests;
+  std::optional<uint32_t> mGrantedLifetime;
 };
 
 } // namespace zark::test

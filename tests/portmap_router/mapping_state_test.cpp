@@ -61,7 +61,7 @@ TEST(PortMapRouterMappingState, RefusesWhatItDoesNotWrite) {
       "",
       "{",
       "[]",
-      "{\"version\": 2, \"routers\": []}",
+      "{\"version\": 3, \"routers\": []}",
       "{\"version\": 1}",
       "{\"version\": 1, \"routers\": {}}",
       // a comment

@@ -185,13 +185,16 @@ TEST_F(PortMapRouterSave, AppliesThreeRulesOneOfThemARange) {
   EXPECT_EQ(0600u, info.st_mode & 0777);
 }
 
-TEST_F(PortMapRouterSave, UnchangedSetSendsNoRequest) {
+TEST_F(PortMapRouterSave, UnchangedSetIsVerifiedOnTheRouter) {
   ASSERT_EQ(0, Save(ThreeRules()));
   mIgd.ResetCounts();
 
   ASSERT_EQ(0, Save(ThreeRules()));
 
-  EXPECT_EQ(0, mIgd.TotalRequests());
+  // IGD:1 cannot list by port range: one lookup per mapping.
+  EXPECT_EQ((std::map<std::string, int>{{"GET", 1},
+                                        {"GetSpecificPortMappingEntry", 5}}),
+            mIgd.Counts());
   EXPECT_EQ(5u, mIgd.Table().size());
 }
 
@@ -211,10 +214,11 @@ TEST_F(PortMapRouterSave, TenChangesOfAHundredCostRequestsForTheChangesOnly) {
 
   ASSERT_EQ(0, Save(rules)) << mResult.detail.text;
 
+  // The 90 unchanged ones are looked up too.
   EXPECT_EQ((std::map<std::string, int>{{"GET", 1},
                                         {"DeletePortMapping", 10},
                                         {"AddPortMapping", 10},
-                                        {"GetSpecificPortMappingEntry", 10}}),
+                                        {"GetSpecificPortMappingEntry", 100}}),
             mIgd.Counts());
   EXPECT_EQ(1, mIgd.MaxOpenConnections());
   EXPECT_EQ(100u, mIgd.Table().size());
@@ -344,15 +348,37 @@ TEST_F(PortMapRouterSave, ConflictIsReportedForItsRuleAndTheRestApplied) {
   EXPECT_EQ(2u, table.size());
   EXPECT_EQ("127.0.0.9", table[0].client);
   EXPECT_EQ(2222, table[1].externalPort);
-  // The saved rules are the old ones; the state says what the router has.
-  ASSERT_EQ(1u, SavedRules().size());
-  EXPECT_EQ("old", SavedRules()[0].ruleId);
+  // The rules are kept; the state says what the router has and why the
+  // other mapping is not ours.
+  EXPECT_NE(nullptr, std::strstr(mResult.detail.text,
+                                 "conflict with another mapping: "));
+  EXPECT_NE(nullptr, std::strstr(mResult.detail.text,
+                                 "by 127.0.0.9:80 (\"someone else\")"));
+  ASSERT_EQ(2u, SavedRules().size());
+  EXPECT_EQ("web", SavedRules()[0].ruleId);
   MappingState state = State();
   RouterRecord *record = state.Find(kGateway, RouterProtocol::kUpnp);
   ASSERT_NE(nullptr, record);
-  ASSERT_EQ(1u, record->mappings.size());
-  EXPECT_EQ(2222, record->mappings[0].externalPort);
-  EXPECT_TRUE(record->mappings[0].held);
+  ASSERT_EQ(2u, record->mappings.size());
+  const RecordedMapping *web = record->Find(IpProtocol::kTcp, 8080);
+  ASSERT_NE(nullptr, web);
+  EXPECT_FALSE(web->held);
+  EXPECT_EQ(MappingApply::kRefused, web->apply);
+  EXPECT_EQ(ZARK_FAILURE_CONFLICT, web->failure);
+  EXPECT_NE(std::string::npos, web->reason.find("someone else"));
+  const RecordedMapping *ssh = record->Find(IpProtocol::kTcp, 2222);
+  ASSERT_NE(nullptr, ssh);
+  EXPECT_TRUE(ssh->held);
+  EXPECT_EQ(MappingApply::kOnRouter, ssh->apply);
+  ASSERT_TRUE(record->lastJob.has_value());
+  EXPECT_FALSE(record->lastJob->ok);
+  EXPECT_EQ(ZARK_FAILURE_CONFLICT, record->lastJob->failure);
+
+  // The rule no longer wanted: the foreign mapping is left alone.
+  mIgd.ResetCounts();
+  ASSERT_EQ(0, Save({Rule("ssh", "tcp", "2222", "22")})) << mResult.detail.text;
+  EXPECT_EQ(0, mIgd.Count("DeletePortMapping"));
+  EXPECT_EQ("someone else", mIgd.Table()[0].description);
 }
 
 TEST_F(PortMapRouterSave, RouterThatClosesMidSaveEndsItAndTheNextSaveRepairs) {
@@ -377,24 +403,31 @@ TEST_F(PortMapRouterSave, RouterThatClosesMidSaveEndsItAndTheNextSaveRepairs) {
   EXPECT_NE(nullptr,
             std::strstr(mResult.detail.text, "no reply from the router"));
   EXPECT_EQ(3, mIgd.Count("AddPortMapping")); // stopped at the first silence
-  EXPECT_NE(0, ::access(ZARK_PORTMAP_RULE_CONF, F_OK)); // nothing saved
+  EXPECT_EQ(4u, SavedRules().size());         // the rules are kept
   MappingState state = State();
   RouterRecord *record = state.Find(kGateway, RouterProtocol::kUpnp);
   ASSERT_NE(nullptr, record);
-  ASSERT_EQ(3u, record->mappings.size());
+  ASSERT_EQ(4u, record->mappings.size());
   EXPECT_TRUE(record->mappings[0].held);
   EXPECT_TRUE(record->mappings[1].held);
   EXPECT_FALSE(record->mappings[2].held); // may or may not be there
   EXPECT_EQ(8003, record->mappings[2].externalPort);
+  EXPECT_EQ(MappingApply::kPending, record->mappings[2].apply);
+  EXPECT_FALSE(record->mappings[3].held); // never asked
+  EXPECT_EQ(MappingApply::kPending, record->mappings[3].apply);
+  EXPECT_EQ(ZARK_FAILURE_ROUTER_NOT_ANSWERING, record->mappings[3].failure);
+  EXPECT_NE(std::string::npos,
+            record->mappings[3].reason.find("did not answer within 8 s"));
 
   // The router answers again: the next save does exactly the rest.
   mIgd.OnAction("AddPortMapping",
                 [](const SoapRequest &) { return std::optional<HttpReply>(); });
   mIgd.ResetCounts();
   ASSERT_EQ(0, Save(rules)) << mResult.detail.text;
+  // Two lookups of the held ones, two adds and their confirmations.
   EXPECT_EQ((std::map<std::string, int>{{"GET", 1},
                                         {"AddPortMapping", 2},
-                                        {"GetSpecificPortMappingEntry", 2}}),
+                                        {"GetSpecificPortMappingEntry", 4}}),
             mIgd.Counts());
   EXPECT_EQ(4u, mIgd.Table().size());
   EXPECT_EQ(4u, SavedRules().size());
@@ -436,7 +469,16 @@ TEST_F(PortMapRouterSave, FullTableStopsTheAddStage) {
   EXPECT_NE(nullptr, std::strstr(mResult.detail.text, "table full"));
   EXPECT_EQ(3, mIgd.Count("AddPortMapping"));
   MappingState state = State();
-  EXPECT_EQ(2u, state.Find(kGateway, RouterProtocol::kUpnp)->mappings.size());
+  const RouterRecord *record = state.Find(kGateway, RouterProtocol::kUpnp);
+  ASSERT_NE(nullptr, record);
+  ASSERT_EQ(4u, record->mappings.size());
+  EXPECT_EQ(2, std::count_if(record->mappings.begin(), record->mappings.end(),
+                             [](const RecordedMapping &mapping) {
+                               return mapping.held;
+                             }));
+  EXPECT_EQ(MappingApply::kRefused, record->mappings[2].apply);
+  EXPECT_EQ(ZARK_FAILURE_TABLE_FULL, record->mappings[2].failure);
+  EXPECT_EQ(MappingApply::kPending, record->mappings[3].apply);
 }
 
 TEST_F(PortMapRouterSave, AddThatCannotBeReadBackStaysUncertain) {
@@ -479,8 +521,13 @@ TEST_F(PortMapRouterSave, TheJobStopsWhenItsTimeIsUp) {
   EXPECT_EQ(5u, result.errType);
   EXPECT_NE(nullptr, std::strstr(result.detail.text, "ran out of time"));
   EXPECT_EQ(0, mIgd.Count("AddPortMapping"));
-  EXPECT_TRUE(State().Find(kGateway, RouterProtocol::kUpnp) == nullptr ||
-              State().Find(kGateway, RouterProtocol::kUpnp)->mappings.empty());
+  // The wanted mapping is recorded as not applied yet.
+  MappingState state = State();
+  const RouterRecord *record = state.Find(kGateway, RouterProtocol::kUpnp);
+  ASSERT_NE(nullptr, record);
+  ASSERT_EQ(1u, record->mappings.size());
+  EXPECT_FALSE(record->mappings[0].held);
+  EXPECT_EQ(MappingApply::kPending, record->mappings[0].apply);
 }
 
 TEST_F(PortMapRouterSave, VerifyFlagReaddsWhatTheRouterLost) {
@@ -598,7 +645,9 @@ TEST_F(PortMapRouterSave,
   EXPECT_EQ(5u, mResult.errType);
   EXPECT_NE(nullptr, std::strstr(mResult.detail.text, "router port tcp 8080"));
   EXPECT_TRUE(mNatPmp.Table().empty());
-  EXPECT_EQ(2, mNatPmp.Requests());
+  // The add, giving the other port back, and the outside address (to tell
+  // a double NAT).
+  EXPECT_EQ(3, mNatPmp.Requests());
 }
 
 TEST_F(PortMapRouterSave, SwitchingProtocolsDeletesThroughTheOldOne) {

@@ -1,6 +1,8 @@
-// KLibApplySavedRules: the zarkportforward tool's apply and renewal jobs.
+// KLibApplySavedRules and KLibRepairSavedRules: applying the saved rules as
+// they are (the zarkportforward tool's apply and renewal jobs, a repair).
 #include "zarkportforward.h"
 
+#include "api/saved_rules_access.h"
 #include "apply/save_rules.h"
 #include "base/portmap_log.h"
 
@@ -8,18 +10,16 @@
 #include <memory>
 #include <span>
 
+namespace zark::portmap {
 namespace {
 
-struct RulesArrayDeleter {
-  void operator()(ZARK_ROUTER_RULE *rules) const { KLibFreeRulesArr(rules); }
-};
-
-} // namespace
-
-extern "C" int KLibApplySavedRules(const char *gatewayIP, bool renew,
-                                   ZARK_PORTMAP_APPLY_SUMMARY *summary,
-                                   ZARK_ROUTER_SAVE_RULE_RESULT *result) {
-  using namespace zark::portmap;
+// Applies the saved rule configuration as it is: the router is asked about
+// every mapping believed held, what it lost is added again, and leases
+// about to end are refreshed. The results of KLibApplySavedRules.
+int ApplySavedRules(const char *function, const char *gatewayIP,
+                    ApplyOptions options, ZARK_PORTMAP_APPLY_SUMMARY *summary,
+                    ZARK_ROUTER_SAVE_RULE_RESULT *result,
+                    ZARK_SAVE_RULE_PROGRESS_CB callback, void *arg) {
   ZARK_ROUTER_SAVE_RULE_RESULT local{};
   ZARK_ROUTER_SAVE_RULE_RESULT *const target =
       result != nullptr ? result : &local;
@@ -29,44 +29,56 @@ extern "C" int KLibApplySavedRules(const char *gatewayIP, bool renew,
     *summary = ZARK_PORTMAP_APPLY_SUMMARY{};
   }
   if (gatewayIP == nullptr) {
-    ZARK_PM_LOG_ERROR("KLibApplySavedRules: no gateway given");
+    ZARK_PM_LOG_ERROR("%s: no gateway given", function);
     out.errType = kSaveErrBadParameter;
     return -1;
   }
-  int count = 0;
-  ZARK_ROUTER_RULE *raw = nullptr;
-  ZARK_LIBZARKPORTMAP_ERR readErr{};
-  if (KLibGetRulesArrFromRuleConf(&count, &raw, nullptr, false, &readErr) < 0) {
+  SavedRuleArray saved;
+  if (!ReadSavedRules(saved)) {
     return ZARK_APPLY_SAVED_RULES_UNREADABLE;
   }
-  std::unique_ptr<ZARK_ROUTER_RULE, RulesArrayDeleter> rules(raw);
   try {
-    // The saved rules are applied as they are: the router is asked about
-    // every mapping believed held, so that one it lost (a reboot) is added
-    // again, and leases about to end are refreshed.
-    ApplyOptions options;
     options.verifyUnchanged = true;
     options.refreshLeases = true;
     options.writeRuleConf = false;
-    options.reportProgress = !renew;
     ApplySummary done;
-    const int rc = ApplyRules(gatewayIP,
-                              std::span<const ZARK_ROUTER_RULE>(
-                                  rules.get(), static_cast<std::size_t>(count)),
-                              options, DefaultApplyEnvironment(), out, nullptr,
-                              nullptr, &done);
-    if (summary != nullptr) {
-      summary->deleted = done.deleted;
-      summary->added = done.added;
-      summary->checked = done.checked;
-      summary->unchanged = done.unchanged;
-      summary->failed = done.failed;
-    }
+    const int rc =
+        ApplyRules(gatewayIP, saved.Span(), options, DefaultApplyEnvironment(),
+                   out, callback, arg, &done);
+    CopySummary(done, summary);
     return rc;
   } catch (const std::exception &e) {
     // Nothing may cross the C boundary.
-    ZARK_PM_LOG_ERROR("KLibApplySavedRules: %s", e.what());
+    ZARK_PM_LOG_ERROR("%s: %s", function, e.what());
     out.errType = kSaveErrGeneric;
     return -1;
   }
+}
+
+} // namespace
+} // namespace zark::portmap
+
+extern "C" int KLibApplySavedRules(const char *gatewayIP, bool renew,
+                                   ZARK_PORTMAP_APPLY_SUMMARY *summary,
+                                   ZARK_ROUTER_SAVE_RULE_RESULT *result) {
+  zark::portmap::ApplyOptions options;
+  options.reportProgress = !renew;
+  options.jobKind = renew ? "renew" : "save";
+  return zark::portmap::ApplySavedRules("KLibApplySavedRules", gatewayIP,
+                                        options, summary, result, nullptr,
+                                        nullptr);
+}
+
+extern "C" int KLibRepairSavedRules(const char *gatewayIP,
+                                    ZARK_PORTMAP_APPLY_SUMMARY *summary,
+                                    ZARK_ROUTER_SAVE_RULE_RESULT *result,
+                                    ZARK_SAVE_RULE_PROGRESS_CB callback,
+                                    void *arg) {
+  zark::portmap::ApplyOptions options;
+  options.reportProgress = true;
+  options.jobKind = "repair";
+  options.askExternalAddress = true;
+  return zark::portmap::ApplySavedRules("KLibRepairSavedRules", gatewayIP,
+                                        options, summary, result, callback,
+                                        arg);
 }

@@ -2,6 +2,8 @@
 
 #include "RouterRuleConf.h"
 #include "apply/apply_progress.h"
+#include "base/failure_kind.h"
+#include "base/ipv4_class.h"
 #include "base/local_network.h"
 #include "base/portmap_log.h"
 #include "base/record_text.h"
@@ -39,9 +41,22 @@ struct Step {
   // when the step is never attempted.
   std::optional<RecordedMapping> before;
   bool attempted = false;
+  bool missing = false; // the router was asked and had lost it
+  bool refresh = false; // held, re-added to renew its lease
 
   [[nodiscard]] Key PortKey() const {
     return {mapping.protocol, mapping.externalPort};
+  }
+  // The state's entry for the mapping, not known to be held.
+  [[nodiscard]] RecordedMapping Unheld() const {
+    RecordedMapping entry;
+    entry.protocol = mapping.protocol;
+    entry.externalPort = mapping.externalPort;
+    entry.internalPort = mapping.internalPort;
+    entry.internalClient = mapping.internalClient;
+    entry.held = false;
+    entry.ruleId = ruleId;
+    return entry;
   }
 };
 
@@ -64,7 +79,19 @@ public:
 private:
   // Records the first failure of the job (its type and text go to the
   // result) and logs every one.
-  void Fail(uint32_t type, const std::string &message);
+  void Fail(uint32_t type, const std::string &message,
+            ZARK_FAILURE_KIND kind = ZARK_FAILURE_OTHER);
+  // Fails the job with what the router answered.
+  void FailFromRouter(const RouterResult &answer, const std::string &where);
+  // Records a wanted mapping the router refused (never ours there).
+  void RecordRefused(const Step &step, ZARK_FAILURE_KIND kind,
+                     const std::string &reason);
+  // Marks what this job did not get to, and what the router did not answer
+  // about, as pending.
+  void MarkPending();
+  // Asks the router for its outside address; notes a double NAT.
+  void LearnExternalAddress(RouterDriver &router);
+  void RecordLastJob();
   [[nodiscard]] bool Failed() const {
     return mResult.errType != ZARK_SAVE_ERR_NONE;
   }
@@ -78,19 +105,37 @@ private:
   void RunStaleDeletions();
   void RunAdditions(RouterDriver &router);
   // What asking the router about a kCheck step found.
-  enum class Checked { kHeld, kMoved, kAddAgain, kRouterGone };
+  // kLost: the router said it holds no such mapping.
+  enum class Checked { kHeld, kMoved, kLost, kAddAgain, kRouterGone };
   Checked CheckStillHeld(RouterDriver &router, const Step &step,
                          const std::string &where);
+  Checked HeldByAnother(const Step &step, const std::string &where,
+                        const RouterMapping &entry);
   // Adds the step's mapping and records the router's answer; where names
   // the rule and port in messages.
-  void AddMapping(RouterDriver &router, const Step &step,
-                  const std::string &where);
+  // unconfirmed: the add is confirmed later by one listing
+  // (ConfirmListed).
+  void AddMapping(RouterDriver &router, Step &step, const std::string &where,
+                  bool unconfirmed = false);
+  // Where the router lists port ranges (IGD:2): reads the wanted ports of
+  // each protocol, one listing each. False when it cannot (then every
+  // mapping is looked up on its own) or the router stopped answering
+  // (mAborted).
+  bool ListWanted(RouterDriver &router, std::map<Key, RouterMapping> &listed,
+                  bool onlyAdded);
+  // What the listing says of a step's port: kHeld (ours, as wanted; no
+  // request needed), kMoved (another mapping holds it: left alone, reported),
+  // kLost (a held one is gone), kAddAgain (to add).
+  Checked CheckListed(const Step &step, const std::string &where,
+                      const std::map<Key, RouterMapping> &listed);
+  // Confirms the adds of mUnconfirmed with one listing per protocol.
+  void ConfirmListed(RouterDriver &router);
   void OnAddConflict(RouterDriver &router, const Step &step,
                      const std::string &where, const RouterResult &added);
-  void OnAddTableFull(const Step &step, const std::string &where,
-                      const RouterResult &added);
-  void OnAddRefused(const Step &step, const std::string &where,
-                    const RouterResult &added);
+  void OnAddTableFull(RouterDriver &router, const Step &step,
+                      const std::string &where, const RouterResult &added);
+  void OnAddRefused(RouterDriver &router, const Step &step,
+                    const std::string &where, const RouterResult &added);
   // Writes the state file when the last write is older than the interval,
   // so that a killed job leaves its progress recorded.
   void SaveStateNowAndThen();
@@ -118,18 +163,77 @@ private:
   int mStaleTotal = 0;
   int mDeleteDone = 0;
   bool mAborted = false;
+  RouterDriver *mRouter = nullptr;
+  std::vector<Step *> mUnconfirmed; // added, to be seen in a listing
+  ZARK_FAILURE_KIND mFailureKind = ZARK_FAILURE_NONE;
+  std::string mFailureReason;
   ApplySummary *mSummary = nullptr;
 };
 
-void Applier::Fail(uint32_t type, const std::string &message) {
+// The failure kind in words, for the log and the result's detail text.
+std::string FailureWords(ZARK_FAILURE_KIND kind, int deadlineSeconds) {
+  switch (kind) {
+  case ZARK_FAILURE_ROUTER_NOT_ANSWERING:
+    return "the router did not answer within " +
+           std::to_string(deadlineSeconds) + " s";
+  case ZARK_FAILURE_CONFLICT:
+    return "conflict with another mapping";
+  case ZARK_FAILURE_PORT_REFUSED:
+    return "port refused by the router's policy";
+  case ZARK_FAILURE_TABLE_FULL:
+    return "the router's mapping table is full";
+  case ZARK_FAILURE_DOUBLE_NAT:
+    return "carrier-grade or double NAT";
+  case ZARK_FAILURE_LEASE_REFUSED:
+    return "the router refused the lease";
+  case ZARK_FAILURE_NOT_CONFIGURED:
+    return "no router configured (router database or configuration missing)";
+  case ZARK_FAILURE_LOCAL:
+    return "a file or resource of this server failed";
+  case ZARK_FAILURE_OTHER:
+  case ZARK_FAILURE_NONE:
+    break;
+  }
+  return "";
+}
+
+void Applier::Fail(uint32_t type, const std::string &message,
+                   ZARK_FAILURE_KIND kind) {
+  const int deadline =
+      mRouter != nullptr ? mRouter->AnswerDeadlineSeconds() : 0;
+  const std::string words = FailureWords(kind, deadline);
+  const std::string text = words.empty() ? message : words + ": " + message;
   ZARK_PM_LOG_ERROR("applying rules to the router at %s: %s", mGateway.c_str(),
-                    message.c_str());
+                    text.c_str());
   if (Failed()) {
     return;
   }
+  mFailureKind = kind;
+  mFailureReason = text;
   mResult.errType = type;
   std::memset(&mResult.detail, 0, sizeof(mResult.detail));
-  CopyText(mResult.detail.text, message);
+  CopyText(mResult.detail.text, text);
+}
+
+void Applier::FailFromRouter(const RouterResult &answer,
+                             const std::string &where) {
+  ZARK_FAILURE_KIND kind =
+      mRouter != nullptr ? mRouter->FailureKind(answer) : ZARK_FAILURE_OTHER;
+  Fail(kSaveErrRouter,
+       where.empty() ? answer.message : where + ": " + answer.message,
+       kind == ZARK_FAILURE_NONE ? ZARK_FAILURE_OTHER : kind);
+}
+
+void Applier::RecordRefused(const Step &step, ZARK_FAILURE_KIND kind,
+                            const std::string &reason) {
+  RecordedMapping entry = step.Unheld();
+  entry.apply = MappingApply::kRefused;
+  entry.failure = kind;
+  const int deadline =
+      mRouter != nullptr ? mRouter->AnswerDeadlineSeconds() : 0;
+  const std::string words = FailureWords(kind, deadline);
+  entry.reason = words.empty() ? reason : words + ": " + reason;
+  Record().Put(entry);
 }
 
 bool Applier::IsRouterGone(RouterOutcome outcome) const {
@@ -155,8 +259,16 @@ void Applier::Plan(const std::vector<WantedMapping> &wanted) {
     byKey.emplace(Key{want.protocol, want.externalPort}, &want);
     mWantedKeys.insert({want.protocol, want.externalPort});
   }
+  std::vector<Key> refusedUnwanted;
   for (const RecordedMapping &recorded : record.mappings) {
     auto found = byKey.find({recorded.protocol, recorded.externalPort});
+    if (recorded.apply == MappingApply::kRefused) {
+      // The router never held it for us: nothing to delete there.
+      if (found == byKey.end()) {
+        refusedUnwanted.push_back({recorded.protocol, recorded.externalPort});
+      }
+      continue;
+    }
     bool keep = found != byKey.end() &&
                 found->second->internalPort == recorded.internalPort &&
                 recorded.internalClient == mClient;
@@ -171,6 +283,9 @@ void Applier::Plan(const std::vector<WantedMapping> &wanted) {
     step.ruleId = recorded.ruleId;
     step.before = recorded;
     mDeletions.push_back(std::move(step));
+  }
+  for (const Key &key : refusedUnwanted) {
+    record.Remove(key.first, key.second);
   }
   const int64_t now = mEnv.now();
   for (const WantedMapping &want : wanted) {
@@ -189,8 +304,12 @@ void Applier::Plan(const std::vector<WantedMapping> &wanted) {
     if (!same) {
       step.kind = Step::Kind::kAdd;
     } else if (mOptions.refreshLeases && recorded->expires != 0 &&
-               recorded->expires - now < mEnv.renewAhead.count()) {
+               recorded->expires - now <
+                   (mOptions.renewAtHalfLease
+                        ? static_cast<int64_t>(recorded->leaseSeconds / 2) + 1
+                        : mEnv.renewAhead.count())) {
       step.kind = Step::Kind::kAdd;
+      step.refresh = true;
     } else if (mOptions.verifyUnchanged) {
       step.kind = Step::Kind::kCheck;
     } else {
@@ -221,13 +340,7 @@ void Applier::MarkBeforeTouching() {
     if (step.kind == Step::Kind::kCheck) {
       continue;
     }
-    RecordedMapping entry;
-    entry.protocol = step.mapping.protocol;
-    entry.externalPort = step.mapping.externalPort;
-    entry.internalPort = step.mapping.internalPort;
-    entry.internalClient = step.mapping.internalClient;
-    entry.held = false;
-    entry.ruleId = step.ruleId;
+    RecordedMapping entry = step.Unheld();
     if (step.before && step.before->held &&
         step.before->internalPort == entry.internalPort &&
         step.before->internalClient == entry.internalClient) {
@@ -273,7 +386,7 @@ void Applier::RunDeletions(RouterDriver &router) {
       }
     } else if (IsRouterGone(deleted.outcome)) {
       // Left "not known to be held": the next job deletes it again.
-      Fail(kSaveErrRouter, deleted.message);
+      FailFromRouter(deleted, "");
       mAborted = true;
       if (add != nullptr && add->before) {
         add->before->held = false;
@@ -290,8 +403,7 @@ void Applier::RunDeletions(RouterDriver &router) {
       if (add != nullptr) {
         add->before = kept;
       }
-      Fail(kSaveErrRouter, "deleting " + PortText(key.first, key.second) +
-                               ": " + deleted.message);
+      FailFromRouter(deleted, "deleting " + PortText(key.first, key.second));
     }
     ++mDeleteDone;
     mProgress.Report("del", mDeleteDone, total);
@@ -337,18 +449,29 @@ void Applier::RunStaleDeletions() {
 }
 
 void Applier::RecordAdded(const Step &step, const RouterResult &added) {
-  RecordedMapping entry;
-  entry.protocol = step.mapping.protocol;
-  entry.externalPort = step.mapping.externalPort;
-  entry.internalPort = step.mapping.internalPort;
-  entry.internalClient = step.mapping.internalClient;
+  RecordedMapping entry = step.Unheld();
   entry.leaseSeconds = added.leaseSeconds;
   entry.expires = added.leaseSeconds == 0
                       ? 0
                       : mEnv.now() + static_cast<int64_t>(added.leaseSeconds);
   entry.held = true;
   entry.ruleId = step.ruleId;
+  entry.apply = MappingApply::kOnRouter;
+  entry.verified = mEnv.now();
   Record().Put(entry);
+}
+
+Applier::Checked Applier::HeldByAnother(const Step &step,
+                                        const std::string &where,
+                                        const RouterMapping &entry) {
+  // Another mapping holds the port: never taken over, reported with it.
+  ++mSummary->failed;
+  const std::string reason =
+      where + " is held on the router by " + entry.internalClient + ":" +
+      std::to_string(entry.internalPort) + " (\"" + entry.description + "\")";
+  RecordRefused(step, ZARK_FAILURE_CONFLICT, reason);
+  Fail(kSaveErrRouter, reason, ZARK_FAILURE_CONFLICT);
+  return Checked::kMoved;
 }
 
 Applier::Checked Applier::CheckStillHeld(RouterDriver &router, const Step &step,
@@ -368,15 +491,10 @@ Applier::Checked Applier::CheckStillHeld(RouterDriver &router, const Step &step,
       RecordAdded(step, held);
       return Checked::kHeld;
     }
-    ++mSummary->failed;
-    Record().Remove(key.first, key.second);
-    Fail(kSaveErrRouter, where + " now goes to " + entry.internalClient + ":" +
-                             std::to_string(entry.internalPort) +
-                             " on the router");
-    return Checked::kMoved;
+    return HeldByAnother(step, where, entry);
   }
   if (IsRouterGone(checked.outcome)) {
-    Fail(kSaveErrRouter, checked.message);
+    FailFromRouter(checked, where);
     mAborted = true;
     return Checked::kRouterGone;
   }
@@ -384,39 +502,55 @@ Applier::Checked Applier::CheckStillHeld(RouterDriver &router, const Step &step,
   // until the router answers, it is not known to be there.
   if (RecordedMapping *recorded = Record().Find(key.first, key.second)) {
     recorded->held = false;
+    if (checked.outcome == RouterOutcome::kNotFound) {
+      recorded->apply = MappingApply::kMissing;
+      recorded->reason = "the router lost it";
+    }
   }
-  return Checked::kAddAgain;
+  return checked.outcome == RouterOutcome::kNotFound ? Checked::kLost
+                                                     : Checked::kAddAgain;
 }
 
-void Applier::AddMapping(RouterDriver &router, const Step &step,
-                         const std::string &where) {
+void Applier::AddMapping(RouterDriver &router, Step &step,
+                         const std::string &where, bool unconfirmed) {
   ++mSummary->operations;
-  RouterResult added = router.AddPortMapping(step.mapping);
+  RouterResult added = unconfirmed
+                           ? router.AddPortMappingUnconfirmed(step.mapping)
+                           : router.AddPortMapping(step.mapping);
   switch (added.outcome) {
   case RouterOutcome::kOk:
+    if (unconfirmed) {
+      mUnconfirmed.push_back(&step);
+      break;
+    }
     ++mSummary->added;
+    if (step.missing) {
+      ++mSummary->repaired;
+      syslog(LOG_INFO, "%s:%d %s: restored on the router at %s", __FILE__,
+             __LINE__, where.c_str(), mGateway.c_str());
+    }
     RecordAdded(step, added);
     break;
   case RouterOutcome::kConflict:
     OnAddConflict(router, step, where, added);
     break;
   case RouterOutcome::kNotHeld:
-    OnAddTableFull(step, where, added);
+    OnAddTableFull(router, step, where, added);
     break;
   case RouterOutcome::kRefused:
   case RouterOutcome::kNotFound:
   case RouterOutcome::kUnsupported:
-    OnAddRefused(step, where, added);
+    OnAddRefused(router, step, where, added);
     break;
   case RouterOutcome::kBadReply:
     // It may or may not be there: stays "not known to be held".
     ++mSummary->failed;
-    Fail(kSaveErrRouter, where + ": " + added.message);
+    FailFromRouter(added, where);
     break;
   case RouterOutcome::kNoAnswer:
   case RouterOutcome::kNoRouter:
   case RouterOutcome::kFailed:
-    Fail(kSaveErrRouter, where + ": " + added.message);
+    FailFromRouter(added, where);
     mAborted = true;
     break;
   }
@@ -427,8 +561,21 @@ void Applier::OnAddConflict(RouterDriver &router, const Step &step,
                             const RouterResult &added) {
   const Key key = step.PortKey();
   ++mSummary->failed;
-  Record().Remove(key.first, key.second);
-  Fail(kSaveErrRouter, where + " is taken on the router: " + added.message);
+  // Name the mapping that holds the port, where the router can be asked.
+  std::string holder;
+  RouterMapping other;
+  if (added.grantedExternalPort == 0) {
+    ++mSummary->operations;
+    if (router.GetSpecificPortMapping(key.first, key.second, other).Ok()) {
+      holder = " by " + other.internalClient + ":" +
+               std::to_string(other.internalPort) + " (\"" + other.description +
+               "\")";
+    }
+  }
+  const std::string reason =
+      where + " is taken on the router" + holder + ": " + added.message;
+  RecordRefused(step, ZARK_FAILURE_CONFLICT, reason);
+  Fail(kSaveErrRouter, reason, ZARK_FAILURE_CONFLICT);
   // NAT-PMP granted another port: give it back unless it is one of ours.
   uint16_t granted = added.grantedExternalPort;
   if (granted == 0 || mWantedKeys.count({key.first, granted}) != 0 ||
@@ -446,31 +593,156 @@ void Applier::OnAddConflict(RouterDriver &router, const Step &step,
   }
 }
 
-void Applier::OnAddTableFull(const Step &step, const std::string &where,
+void Applier::OnAddTableFull(RouterDriver &router, const Step &step,
+                             const std::string &where,
                              const RouterResult &added) {
   // The router's table is full: further adds would be dropped too.
-  OnAddRefused(step, where, added);
+  OnAddRefused(router, step, where, added);
   mAborted = true;
 }
 
-void Applier::OnAddRefused(const Step &step, const std::string &where,
+void Applier::OnAddRefused(RouterDriver &router, const Step &step,
+                           const std::string &where,
                            const RouterResult &added) {
   ++mSummary->failed;
-  Record().Remove(step.mapping.protocol, step.mapping.externalPort);
-  Fail(kSaveErrRouter, where + ": " + added.message);
+  ZARK_FAILURE_KIND kind = router.FailureKind(added);
+  if (kind == ZARK_FAILURE_NONE) {
+    kind = ZARK_FAILURE_OTHER;
+  }
+  RecordRefused(step, kind, where + ": " + added.message);
+  Fail(kSaveErrRouter, where + ": " + added.message, kind);
 }
 
 void Applier::SaveStateNowAndThen() {
-  if (!mAborted && Clock::now() - mLastStateSave >= mEnv.stateSaveInterval &&
-      !SaveMappingState(mEnv.statePath, mState)) {
-    // Logged; the final write decides the result.
+  if (!mAborted && Clock::now() - mLastStateSave >= mEnv.stateSaveInterval) {
+    // A failed write is logged; the final write decides the result.
+    (void)SaveMappingState(mEnv.statePath, mState);
     mLastStateSave = Clock::now();
   }
+}
+
+bool Applier::ListWanted(RouterDriver &router,
+                         std::map<Key, RouterMapping> &listed, bool onlyAdded) {
+  listed.clear();
+  std::map<IpProtocol, std::pair<uint16_t, uint16_t>> ranges;
+  auto widen = [&ranges](const Step &step) {
+    auto [it, added] =
+        ranges.try_emplace(step.mapping.protocol, step.mapping.externalPort,
+                           step.mapping.externalPort);
+    if (!added) {
+      it->second.first = std::min(it->second.first, step.mapping.externalPort);
+      it->second.second =
+          std::max(it->second.second, step.mapping.externalPort);
+    }
+  };
+  if (onlyAdded) {
+    for (const Step *step : mUnconfirmed) {
+      widen(*step);
+    }
+  } else {
+    for (const Step &step : mAdditions) {
+      widen(step);
+    }
+  }
+  for (const auto &[protocol, range] : ranges) {
+    std::vector<RouterMapping> entries;
+    ++mSummary->operations;
+    RouterResult read =
+        router.ListPortRange(protocol, range.first, range.second, entries);
+    if (read.outcome == RouterOutcome::kUnsupported) {
+      return false;
+    }
+    if (!read.Ok()) {
+      if (IsRouterGone(read.outcome)) {
+        FailFromRouter(read, "listing the router's mappings");
+        mAborted = true;
+      }
+      return false;
+    }
+    for (RouterMapping &entry : entries) {
+      const Key key{entry.protocol, entry.externalPort};
+      listed.emplace(key, std::move(entry));
+    }
+  }
+  return true;
+}
+
+Applier::Checked
+Applier::CheckListed(const Step &step, const std::string &where,
+                     const std::map<Key, RouterMapping> &listed) {
+  auto found = listed.find(step.PortKey());
+  if (found == listed.end()) {
+    return step.kind == Step::Kind::kCheck ? Checked::kLost
+                                           : Checked::kAddAgain;
+  }
+  const RouterMapping &entry = found->second;
+  const bool sameTarget = entry.internalClient == step.mapping.internalClient &&
+                          entry.internalPort == step.mapping.internalPort;
+  // Ours: made for this server under our description. A mapping of this
+  // server under another description is another program's: the router
+  // would let our add replace it.
+  const bool ours = entry.internalClient == step.mapping.internalClient &&
+                    entry.description.starts_with(MappingDescription(""));
+  if (!ours) {
+    return HeldByAnother(step, where, entry);
+  }
+  if (sameTarget && !step.refresh) {
+    if (step.kind == Step::Kind::kCheck) {
+      ++mSummary->checked;
+    }
+    RouterResult held;
+    held.outcome = RouterOutcome::kOk;
+    held.leaseSeconds = entry.leaseSeconds;
+    RecordAdded(step, held);
+    return Checked::kHeld;
+  }
+  return Checked::kAddAgain;
+}
+
+void Applier::ConfirmListed(RouterDriver &router) {
+  std::map<Key, RouterMapping> listed;
+  if (mUnconfirmed.empty() || !ListWanted(router, listed, true)) {
+    // Unconfirmed adds stay "not known to be held" (pending).
+    return;
+  }
+  for (Step *step : mUnconfirmed) {
+    const std::string where =
+        "rule \"" + step->ruleId + "\", router port " +
+        PortText(step->mapping.protocol, step->mapping.externalPort);
+    auto found = listed.find(step->PortKey());
+    if (found == listed.end() ||
+        found->second.internalClient != step->mapping.internalClient ||
+        found->second.internalPort != step->mapping.internalPort) {
+      // Answered success and kept nothing, or evicted by a later add.
+      ++mSummary->failed;
+      const std::string reason =
+          where + ": the router answered success but does not hold it";
+      RecordRefused(*step, ZARK_FAILURE_TABLE_FULL, reason);
+      Fail(kSaveErrRouter, reason, ZARK_FAILURE_TABLE_FULL);
+      continue;
+    }
+    ++mSummary->added;
+    if (step->missing) {
+      ++mSummary->repaired;
+      syslog(LOG_INFO, "%s:%d %s: restored on the router at %s", __FILE__,
+             __LINE__, where.c_str(), mGateway.c_str());
+    }
+    RouterResult held;
+    held.outcome = RouterOutcome::kOk;
+    held.leaseSeconds = found->second.leaseSeconds;
+    RecordAdded(*step, held);
+  }
+  mUnconfirmed.clear();
 }
 
 void Applier::RunAdditions(RouterDriver &router) {
   const int total = static_cast<int>(mAdditions.size());
   int done = 0;
+  std::map<Key, RouterMapping> listed;
+  const bool listing = !mAdditions.empty() && ListWanted(router, listed, false);
+  if (mAborted) {
+    return;
+  }
   for (Step &step : mAdditions) {
     if (mAborted) {
       break;
@@ -486,35 +758,117 @@ void Applier::RunAdditions(RouterDriver &router) {
         "rule \"" + step.ruleId + "\", router port " +
         PortText(step.mapping.protocol, step.mapping.externalPort);
     Checked checked = Checked::kAddAgain;
-    if (step.kind == Step::Kind::kCheck) {
+    if (listing) {
+      checked = CheckListed(step, where, listed);
+      step.missing = checked == Checked::kLost;
+    } else if (step.kind == Step::Kind::kCheck) {
       checked = CheckStillHeld(router, step, where);
       if (checked == Checked::kRouterGone) {
+        step.attempted = false;
         break;
       }
+      step.missing = checked == Checked::kLost;
     }
-    if (checked == Checked::kAddAgain) {
-      AddMapping(router, step, where);
+    if (checked == Checked::kAddAgain || checked == Checked::kLost) {
+      AddMapping(router, step, where, listing);
     }
     ++done;
     mProgress.Report("add", done, total);
     SaveStateNowAndThen();
   }
+  if (listing && !mAborted) {
+    ConfirmListed(router);
+  }
 }
 
 void Applier::PutBackUnattempted() {
   RouterRecord &record = Record();
-  for (std::vector<Step> *steps : {&mDeletions, &mAdditions}) {
-    for (const Step &step : *steps) {
-      if (step.attempted || step.kind == Step::Kind::kCheck) {
-        continue;
-      }
-      if (step.before) {
-        record.Put(*step.before);
-      } else {
-        record.Remove(step.mapping.protocol, step.mapping.externalPort);
-      }
+  for (const Step &step : mDeletions) {
+    if (step.attempted) {
+      continue;
+    }
+    if (step.before) {
+      record.Put(*step.before);
     }
   }
+  MarkPending();
+}
+
+void Applier::MarkPending() {
+  RouterRecord &record = Record();
+  const std::string reason =
+      mFailureReason.empty() ? "not applied yet" : mFailureReason;
+  for (const Step &step : mAdditions) {
+    if (step.attempted) {
+      continue;
+    }
+    RecordedMapping entry;
+    if (step.kind == Step::Kind::kCheck && step.before) {
+      // Believed held, but the router was not asked this time.
+      entry = *step.before;
+    } else {
+      entry = step.Unheld();
+      if (step.before && step.before->held &&
+          step.before->internalPort == entry.internalPort &&
+          step.before->internalClient == entry.internalClient) {
+        entry = *step.before; // a lease refresh that did not happen
+      }
+    }
+    entry.apply = MappingApply::kPending;
+    entry.failure = mFailureKind;
+    entry.reason = reason;
+    record.Put(entry);
+  }
+  // An add the router did not answer about: may or may not be there.
+  for (RecordedMapping &entry : record.mappings) {
+    if (!entry.held && entry.apply == MappingApply::kOnRouter) {
+      entry.apply = MappingApply::kPending;
+      entry.failure = mFailureKind;
+      entry.reason = reason;
+    }
+  }
+}
+
+void Applier::LearnExternalAddress(RouterDriver &router) {
+  std::string address;
+  ++mSummary->operations;
+  RouterResult asked = router.GetExternalAddress(address);
+  if (!asked.Ok()) {
+    return;
+  }
+  Record().externalAddress = address;
+  std::optional<uint32_t> parsed = ParseIpv4(address);
+  if (!parsed || !IsBehindNat(*parsed)) {
+    return;
+  }
+  const std::string words =
+      "the router's outside address " + address + " is " +
+      Ipv4ClassName(ClassifyIpv4(*parsed)) +
+      ": the ports are not reachable from the internet (carrier-grade or "
+      "double NAT)";
+  ZARK_PM_LOG_ERROR("%s", words.c_str());
+  if (!Failed()) {
+    // The router took every mapping, yet they do not reach the internet.
+    mFailureKind = ZARK_FAILURE_DOUBLE_NAT;
+    mFailureReason = words;
+  } else {
+    mFailureReason += "; " + words;
+    std::string detail = mResult.detail.text;
+    CopyText(mResult.detail.text, detail + "; " + words);
+  }
+}
+
+void Applier::RecordLastJob() {
+  LastJob job;
+  job.kind = mOptions.jobKind;
+  job.ended = mEnv.now();
+  job.ok = !Failed();
+  job.repaired = mSummary->repaired;
+  job.added = mSummary->added;
+  job.deleted = mSummary->deleted;
+  job.failure = mFailureKind;
+  job.reason = mFailureReason;
+  Record().lastJob = job;
 }
 
 int Applier::Run(std::span<const ZARK_ROUTER_RULE> rules,
@@ -563,8 +917,8 @@ int Applier::Run(std::span<const ZARK_ROUTER_RULE> rules,
   }
   mProtocol = choice.protocol;
 
-  // The rule configuration to write on success, built now so that a text
-  // that does not fit stops the job before the router is touched.
+  // The rule configuration, written before the router is touched: a rule
+  // set that passed the checks is never lost to a router that fails.
   RouterRuleConfWriter writer;
   for (const ZARK_ROUTER_RULE &rule : rules) {
     if (!writer.AddRule(std::string(Field(rule.rule_id)), rule.enable != 0,
@@ -577,10 +931,16 @@ int Applier::Run(std::span<const ZARK_ROUTER_RULE> rules,
       return -1;
     }
   }
+  if (mOptions.writeRuleConf && !writer.Sync(mEnv.ruleConfPath)) {
+    Fail(kSaveErrIo, mEnv.ruleConfPath + " cannot be written",
+         ZARK_FAILURE_LOCAL);
+    return -1;
+  }
 
   std::optional<std::string> client = mEnv.localAddress(mGateway);
   if (!client) {
-    Fail(kSaveErrRouter, "no route to the gateway " + mGateway);
+    Fail(kSaveErrRouter, "no route to the gateway " + mGateway,
+         ZARK_FAILURE_LOCAL);
     return -1;
   }
   mClient = *client;
@@ -616,6 +976,7 @@ int Applier::Run(std::span<const ZARK_ROUTER_RULE> rules,
     }
     std::unique_ptr<RouterDriver> router =
         mEnv.makeRouter(mProtocol, mGateway, &Record());
+    mRouter = router.get();
     if (router == nullptr) {
       Fail(kSaveErrGeneric, "no driver for protocol " +
                                 std::string(RouterProtocolName(mProtocol)));
@@ -631,12 +992,17 @@ int Applier::Run(std::span<const ZARK_ROUTER_RULE> rules,
     }
     mProgress.Report("add", 0, addTotal);
     RunAdditions(*router);
+    if (!mAborted && (mOptions.askExternalAddress || mSummary->failed > 0)) {
+      LearnExternalAddress(*router);
+    }
     PutBackUnattempted();
     std::string location = router->Location();
     if (!location.empty()) {
       Record().location = location;
       Record().finiteLeases = router->FiniteLeases();
     }
+    RecordLastJob();
+    mRouter = nullptr;
     mState.DropEmpty();
     if (!SaveMappingState(mEnv.statePath, mState)) {
       Fail(kSaveErrIo,
@@ -647,11 +1013,6 @@ int Applier::Run(std::span<const ZARK_ROUTER_RULE> rules,
   }
 
   if (Failed()) {
-    return -1;
-  }
-  if (mOptions.writeRuleConf && !writer.Sync(mEnv.ruleConfPath)) {
-    Fail(kSaveErrIo, "the router holds the rules but " + mEnv.ruleConfPath +
-                         " cannot be written");
     return -1;
   }
   mProgress.Finish();
@@ -716,8 +1077,11 @@ extern "C" int KLibSaveRules(const char *gatewayIP, int count,
   }
   try {
     ApplyOptions options;
-    // flag: also check the mappings the library believes unchanged.
-    options.verifyUnchanged = flag;
+    // Every save asks the router about the mappings the library believes
+    // unchanged and adds again what it lost, whatever flag says: the router,
+    // not the library's memory, decides what is there.
+    (void)flag;
+    options.verifyUnchanged = true;
     ApplyEnvironment environment = DefaultApplyEnvironment();
     return ApplyRules(gatewayIP,
                       std::span<const ZARK_ROUTER_RULE>(

@@ -8,15 +8,19 @@
 //    those the library remembers having made on that router
 //    (mapping_state.h): mappings no longer wanted, or changed, are deleted
 //    first (the "del" stage), then the missing ones are added (the "add"
-//    stage). Unchanged mappings cost no request at all; the router is not
-//    even contacted when nothing changed.
+//    stage). With verifyUnchanged (every save) the router is asked about
+//    the unchanged ones too, and what it lost is added again ("repaired").
 // 4. Before the router is touched, the state file marks every mapping about
 //    to change as "not known to be held"; after each stage (and every
 //    second during a long one) it records what the router answered. A job
 //    that is killed or stopped half way therefore leaves a state that the
 //    next job repairs.
-// 5. On success the rules become the saved rule configuration. On failure
-//    the saved rule configuration is left as it was.
+// 5. A rule set that passed the checks becomes the saved rule configuration
+//    before the router is touched, so that a router that does not answer
+//    or refuses some mappings never costs the administrator the rules: the
+//    mapping state marks each wanted mapping with where it stands (on the
+//    router, refused and why, pending) and the next save, repair or keeper
+//    round applies what is left.
 //
 // Every router operation is bounded by its protocol's deadline (upnp.h,
 // natpmp.h); a router that stops answering ends the job at once with
@@ -69,6 +73,15 @@ struct ApplyOptions {
   bool writeRuleConf = true;
   // Write the progress file (the callback is called either way).
   bool reportProgress = true;
+  // The job's name in the record of the last job: "save", "renew",
+  // "repair".
+  std::string jobKind = "save";
+  // Refresh a lease once half of what the router granted has passed
+  // (instead of renewAhead before its end): the keeper's rule.
+  bool renewAtHalfLease = false;
+  // Also ask the router for its outside address (it is always asked when a
+  // mapping fails, to tell a double NAT).
+  bool askExternalAddress = false;
 };
 
 struct ApplyEnvironment {
@@ -104,6 +117,7 @@ struct ApplySummary {
   int checked = 0;    // mappings asked about (verifyUnchanged)
   int unchanged = 0;  // mappings left alone without a request
   int failed = 0;     // mappings the router refused or dropped
+  int repaired = 0;   // mappings found missing on the router, added again
   int operations = 0; // router operations started
 };
 

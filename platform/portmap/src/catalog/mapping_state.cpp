@@ -1,6 +1,7 @@
 #include "catalog/mapping_state.h"
 
 #include "base/conf_file.h"
+#include "base/failure_kind.h"
 #include "base/local_network.h"
 #include "base/portmap_log.h"
 #include "base/strict_json.h"
@@ -14,9 +15,15 @@
 namespace zark::portmap {
 namespace {
 
-constexpr std::size_t kMaxStateBytes = 16u << 20;
+// Every port of both protocols on one router, each entry written with its
+// longest rule id and reason (about 600 bytes pretty-printed), fits.
+constexpr Json::ArrayIndex kMaxMappings = 2 * 65535;
+constexpr std::size_t kMaxStateBytes = 128u << 20;
 constexpr Json::ArrayIndex kMaxRouters = 64;
-constexpr Json::ArrayIndex kMaxMappings = 65536;
+
+constexpr MappingApply kApplyStates[] = {
+    MappingApply::kOnRouter, MappingApply::kMissing, MappingApply::kRefused,
+    MappingApply::kPending};
 
 bool Fail(std::string &why, std::string text) {
   why = std::move(text);
@@ -57,8 +64,70 @@ bool ReadInteger(const Json::Value &object, const char *key, int64_t min,
   return true;
 }
 
-bool ReadMapping(const Json::Value &value, RecordedMapping &mapping,
+bool ReadFailure(const Json::Value &object, ZARK_FAILURE_KIND &kind,
+                 std::string &reason, std::string &why) {
+  std::string word;
+  if (!ReadString(object, "failure", word, why) ||
+      !ReadString(object, "reason", reason, why)) {
+    return false;
+  }
+  std::optional<ZARK_FAILURE_KIND> parsed = ParseFailureKindWord(word);
+  if (!parsed) {
+    return Fail(why, "unknown failure \"" + word + "\"");
+  }
+  kind = *parsed;
+  return true;
+}
+
+// The members version 2 added to a mapping.
+bool ReadMappingApply(const Json::Value &value, RecordedMapping &mapping,
+                      std::string &why) {
+  std::string state;
+  if (!ReadString(value, "state", state, why) ||
+      !ReadFailure(value, mapping.failure, mapping.reason, why) ||
+      !ReadInteger(value, "verified", 0, INT64_MAX, mapping.verified, why)) {
+    return false;
+  }
+  for (MappingApply apply : kApplyStates) {
+    if (state == MappingApplyWord(apply)) {
+      mapping.apply = apply;
+      return true;
+    }
+  }
+  return Fail(why, "unknown state \"" + state + "\"");
+}
+
+bool ReadLastJob(const Json::Value &value, std::optional<LastJob> &job,
                  std::string &why) {
+  if (value.isNull()) {
+    job.reset();
+    return true;
+  }
+  if (!value.isObject()) {
+    return Fail(why, "\"last_job\" is not an object");
+  }
+  LastJob read;
+  int64_t repaired = 0;
+  int64_t added = 0;
+  int64_t deleted = 0;
+  if (!ReadString(value, "kind", read.kind, why) ||
+      !ReadInteger(value, "ended", 0, INT64_MAX, read.ended, why) ||
+      !ReadBool(value, "ok", read.ok, why) ||
+      !ReadInteger(value, "repaired", 0, INT32_MAX, repaired, why) ||
+      !ReadInteger(value, "added", 0, INT32_MAX, added, why) ||
+      !ReadInteger(value, "deleted", 0, INT32_MAX, deleted, why) ||
+      !ReadFailure(value, read.failure, read.reason, why)) {
+    return false;
+  }
+  read.repaired = static_cast<int>(repaired);
+  read.added = static_cast<int>(added);
+  read.deleted = static_cast<int>(deleted);
+  job = std::move(read);
+  return true;
+}
+
+bool ReadMapping(const Json::Value &value, int version,
+                 RecordedMapping &mapping, std::string &why) {
   if (!value.isObject()) {
     return Fail(why, "a mapping is not an object");
   }
@@ -87,10 +156,15 @@ bool ReadMapping(const Json::Value &value, RecordedMapping &mapping,
   mapping.externalPort = static_cast<uint16_t>(external);
   mapping.internalPort = static_cast<uint16_t>(internal);
   mapping.leaseSeconds = static_cast<uint32_t>(lease);
-  return true;
+  if (version == 1) {
+    mapping.apply =
+        mapping.held ? MappingApply::kOnRouter : MappingApply::kPending;
+    return true;
+  }
+  return ReadMappingApply(value, mapping, why);
 }
 
-bool ReadRouter(const Json::Value &value, RouterRecord &router,
+bool ReadRouter(const Json::Value &value, int version, RouterRecord &router,
                 std::string &why) {
   if (!value.isObject()) {
     return Fail(why, "a router is not an object");
@@ -110,6 +184,15 @@ bool ReadRouter(const Json::Value &value, RouterRecord &router,
     return Fail(why, "\"protocol\" names no router protocol");
   }
   router.protocol = *parsed;
+  if (version >= 2) {
+    if (!ReadString(value, "external_address", router.externalAddress, why) ||
+        !ReadLastJob(value["last_job"], router.lastJob, why)) {
+      return false;
+    }
+    if (!router.externalAddress.empty() && !ParseIpv4(router.externalAddress)) {
+      return Fail(why, "\"external_address\" is not an IPv4 address");
+    }
+  }
   const Json::Value &mappings = value["mappings"];
   if (!mappings.isArray()) {
     return Fail(why, "\"mappings\" is not an array");
@@ -119,7 +202,7 @@ bool ReadRouter(const Json::Value &value, RouterRecord &router,
   }
   for (Json::ArrayIndex i = 0; i < mappings.size(); ++i) {
     RecordedMapping mapping;
-    if (!ReadMapping(mappings[i], mapping, why)) {
+    if (!ReadMapping(mappings[i], version, mapping, why)) {
       return false;
     }
     if (router.Find(mapping.protocol, mapping.externalPort) != nullptr) {
@@ -141,7 +224,8 @@ bool ParseMappingStateOrThrow(std::string_view text, MappingState &state,
     return Fail(why, "not a JSON object");
   }
   const Json::Value &version = root["version"];
-  if (!version.isInt() || version.asInt() != kMappingStateVersion) {
+  if (!version.isInt() || version.asInt() < 1 ||
+      version.asInt() > kMappingStateVersion) {
     return Fail(why, "unknown version");
   }
   const Json::Value &routers = root["routers"];
@@ -154,7 +238,7 @@ bool ParseMappingStateOrThrow(std::string_view text, MappingState &state,
   MappingState parsed;
   for (Json::ArrayIndex i = 0; i < routers.size(); ++i) {
     RouterRecord router;
-    if (!ReadRouter(routers[i], router, why)) {
+    if (!ReadRouter(routers[i], version.asInt(), router, why)) {
       return false;
     }
     if (parsed.Find(router.gateway, router.protocol) != nullptr) {
@@ -166,7 +250,28 @@ bool ParseMappingStateOrThrow(std::string_view text, MappingState &state,
   return true;
 }
 
+Json::Value FailureMembers(Json::Value object, ZARK_FAILURE_KIND kind,
+                           const std::string &reason) {
+  object["failure"] = FailureKindWord(kind);
+  object["reason"] = reason;
+  return object;
+}
+
 } // namespace
+
+const char *MappingApplyWord(MappingApply apply) {
+  switch (apply) {
+  case MappingApply::kOnRouter:
+    return "on_router";
+  case MappingApply::kMissing:
+    return "missing";
+  case MappingApply::kRefused:
+    return "refused";
+  case MappingApply::kPending:
+    break;
+  }
+  return "pending";
+}
 
 RecordedMapping *RouterRecord::Find(IpProtocol protocol,
                                     uint16_t externalPort) {
@@ -235,6 +340,21 @@ std::string SerializeMappingState(const MappingState &state) {
     item["protocol"] = std::string(RouterProtocolName(router.protocol));
     item["location"] = router.location;
     item["finite_leases"] = router.finiteLeases;
+    item["external_address"] = router.externalAddress;
+    if (router.lastJob) {
+      const LastJob &job = *router.lastJob;
+      Json::Value last(Json::objectValue);
+      last["kind"] = job.kind;
+      last["ended"] = Json::Value::Int64(job.ended);
+      last["ok"] = job.ok;
+      last["repaired"] = job.repaired;
+      last["added"] = job.added;
+      last["deleted"] = job.deleted;
+      item["last_job"] =
+          FailureMembers(std::move(last), job.failure, job.reason);
+    } else {
+      item["last_job"] = Json::Value(Json::nullValue);
+    }
     Json::Value &mappings = item["mappings"] = Json::Value(Json::arrayValue);
     for (const RecordedMapping &mapping : router.mappings) {
       Json::Value entry(Json::objectValue);
@@ -246,7 +366,10 @@ std::string SerializeMappingState(const MappingState &state) {
       entry["expires"] = Json::Value::Int64(mapping.expires);
       entry["held"] = mapping.held;
       entry["rule_id"] = mapping.ruleId;
-      mappings.append(std::move(entry));
+      entry["state"] = MappingApplyWord(mapping.apply);
+      entry["verified"] = Json::Value::Int64(mapping.verified);
+      mappings.append(
+          FailureMembers(std::move(entry), mapping.failure, mapping.reason));
     }
     routers.append(std::move(item));
   }

@@ -6,16 +6,25 @@
 // One record per gateway and protocol:
 //
 //   {
-//     "version" : 1,
+//     "version" : 2,
 //     "routers" : [ {
 //       "gateway" : "192.168.1.1", "protocol" : "upnp",
 //       "location" : "http://192.168.1.1:5000/rootDesc.xml",
-//       "finite_leases" : false,
+//       "finite_leases" : false, "external_address" : "203.0.113.7",
+//       "last_job" : { "kind" : "save", "ended" : 1700000000, "ok" : false,
+//                      "repaired" : 0, "added" : 1, "deleted" : 0,
+//                      "failure" : "conflict", "reason" : "words" },
 //       "mappings" : [ {
 //         "protocol" : "tcp", "external_port" : 8080, "internal_port" : 80,
 //         "internal_client" : "192.168.1.10", "lease" : 0, "expires" : 0,
-//         "held" : true, "rule_id" : "1" } ] } ]
+//         "held" : true, "rule_id" : "1", "state" : "on_router",
+//         "failure" : "", "reason" : "", "verified" : 1700000000 } ] } ]
 //   }
+//
+// "last_job" may be null. Version 1 files (without "external_address",
+// "last_job" and the mappings' "state", "failure", "reason", "verified")
+// are read too: a held mapping is then "on_router", another "pending", and
+// none was verified.
 //
 // "held" true: the router was seen to hold the mapping. false: it may or may
 // not (a request was under way when the job stopped, or the router stopped
@@ -23,15 +32,21 @@
 // trusting it. "expires": seconds since 1970 when the lease runs out, 0 for
 // a permanent mapping. "location" and "finite_leases" are where the router
 // was found and whether it took only finite leases, for the next job to
-// start from.
+// start from. "state" is what the administrator is shown: on the router
+// (seen there at "verified"), missing (the router lost it), refused (the
+// router said no: "failure" and "reason" say why; never ours on the router,
+// so never deleted there), pending (not applied yet: the router did not
+// answer).
 #ifndef ZARK_PORTMAP_MAPPING_STATE_H
 #define ZARK_PORTMAP_MAPPING_STATE_H
 
 #include "base/port_mapping.h"
 #include "base/router_protocol.h"
 #include "libzarkportmap.h"
+#include "zarkportforward.h"
 
 #include <cstdint>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -40,7 +55,12 @@ namespace zark::portmap {
 
 inline constexpr const char *kMappingStatePath =
     ZARK_PORTMAP_CONF_DIR "/mappings.json";
-inline constexpr int kMappingStateVersion = 1;
+inline constexpr int kMappingStateVersion = 2;
+
+// Where a wanted mapping stands with the router.
+enum class MappingApply : uint8_t { kOnRouter, kMissing, kRefused, kPending };
+// "on_router", "missing", "refused", "pending".
+[[nodiscard]] const char *MappingApplyWord(MappingApply apply);
 
 struct RecordedMapping {
   IpProtocol protocol = IpProtocol::kTcp;
@@ -51,9 +71,27 @@ struct RecordedMapping {
   int64_t expires = 0; // 0: no end
   bool held = false;
   std::string ruleId;
+  MappingApply apply = MappingApply::kPending;
+  ZARK_FAILURE_KIND failure = ZARK_FAILURE_NONE;
+  std::string reason{}; // why it is not on the router, in words
+  int64_t verified = 0; // seen on the router, seconds since 1970; 0 never
 
   friend bool operator==(const RecordedMapping &,
                          const RecordedMapping &) = default;
+};
+
+// The outcome of the last job that talked to a router.
+struct LastJob {
+  std::string kind;  // "save", "renew", "repair"
+  int64_t ended = 0; // seconds since 1970
+  bool ok = false;
+  int repaired = 0;
+  int added = 0;
+  int deleted = 0;
+  ZARK_FAILURE_KIND failure = ZARK_FAILURE_NONE;
+  std::string reason;
+
+  friend bool operator==(const LastJob &, const LastJob &) = default;
 };
 
 struct RouterRecord {
@@ -61,6 +99,8 @@ struct RouterRecord {
   RouterProtocol protocol = RouterProtocol::kUpnp; // RouterDriver::Protocol()
   std::string location;                            // RouterDriver::Location()
   bool finiteLeases = false;
+  std::string externalAddress; // "" unknown
+  std::optional<LastJob> lastJob;
   std::vector<RecordedMapping> mappings;
 
   friend bool operator==(const RouterRecord &, const RouterRecord &) = default;
@@ -92,8 +132,8 @@ struct MappingState {
 
 // The file's text (pure; no file access). Parse refuses anything but the
 // format above (false, why set): strict JSON, version 1, every member of
-// the right type, ports 1..65535, addresses dotted quads. Members it does
-// not know are ignored. Never throws.
+// the right type, ports 1..65535, addresses dotted quads; version 1 or 2.
+// Members it does not know are ignored. Never throws.
 [[nodiscard]] std::string SerializeMappingState(const MappingState &state);
 [[nodiscard]] bool ParseMappingState(std::string_view text, MappingState &state,
                                      std::string &why) noexcept;

@@ -291,6 +291,31 @@ RouterResult NatPmpRouter::AddPortMapping(const PortMapping &mapping) {
   return result;
 }
 
+ZARK_FAILURE_KIND NatPmpRouter::FailureKind(const RouterResult &result) const {
+  if (result.outcome == RouterOutcome::kNotHeld) {
+    // Lifetime 0 granted for a mapping asked with a lifetime.
+    return ZARK_FAILURE_LEASE_REFUSED;
+  }
+  switch (result.code) {
+  case NATPMP_ERR_NOTAUTHORIZED:
+    return ZARK_FAILURE_PORT_REFUSED;
+  case NATPMP_ERR_OUTOFRESOURCES:
+    return ZARK_FAILURE_TABLE_FULL;
+  default:
+    return RouterDriver::FailureKind(result);
+  }
+}
+
+int NatPmpRouter::AnswerDeadlineSeconds() const {
+  std::chrono::milliseconds total{0};
+  std::chrono::milliseconds wait = mOptions.firstWait;
+  for (int attempt = 0; attempt < mOptions.tries; ++attempt) {
+    total += wait;
+    wait *= 2;
+  }
+  return static_cast<int>((total.count() + 999) / 1000);
+}
+
 RouterResult NatPmpRouter::DeletePortMapping(const PortMapping &mapping) {
   RouterResult opened = Open();
   if (!opened.Ok()) {

@@ -50,6 +50,10 @@ public:
   [[nodiscard]] RouterResult
   ListMappings(std::vector<RouterMapping> &entries) override;
   [[nodiscard]] RouterResult GetExternalAddress(std::string &address) override;
+  [[nodiscard]] ZARK_FAILURE_KIND
+  FailureKind(const RouterResult &result) const override;
+  // Every try's wait: firstWait, doubled each time.
+  [[nodiscard]] int AnswerDeadlineSeconds() const override;
   [[nodiscard]] bool FiniteLeases() const override { return true; }
 
 private:

@@ -12,6 +12,7 @@
 
 #include "base/port_mapping.h"
 #include "base/router_protocol.h"
+#include "zarkportforward.h"
 
 #include <cstdint>
 #include <string>
@@ -96,9 +97,36 @@ public:
   [[nodiscard]] virtual RouterResult
   ListMappings(std::vector<RouterMapping> &entries) = 0;
 
+  // Reads the router's mappings of one protocol whose external ports lie in
+  // [firstPort, lastPort], a page of many entries per request, where the
+  // protocol can (IGD:2's GetListOfPortMappings). The entries come in port
+  // order. kOk, kUnsupported (this router cannot: IGD:1, NAT-PMP), kRefused,
+  // kNoAnswer, kBadReply, kNoRouter, kFailed.
+  [[nodiscard]] virtual RouterResult
+  ListPortRange(IpProtocol protocol, uint16_t firstPort, uint16_t lastPort,
+                std::vector<RouterMapping> &entries);
+
+  // Adds a mapping without reading it back: for a caller that confirms a
+  // batch of adds with ListPortRange. Drivers that confirm otherwise (by the
+  // answer itself, NAT-PMP) just add. Results as AddPortMapping's; kOk means
+  // only that the router answered success (leaseSeconds not known).
+  [[nodiscard]] virtual RouterResult
+  AddPortMappingUnconfirmed(const PortMapping &mapping) {
+    return AddPortMapping(mapping);
+  }
+
   // True when the router takes only finite leases, so that mappings must be
   // renewed; the next job starts from it.
   [[nodiscard]] virtual bool FiniteLeases() const { return false; }
+
+  // What kind of failure a result of this driver is, for the administrator
+  // (ZARK_FAILURE_NONE for kOk and kNotFound). The default goes by the
+  // outcome alone; a protocol refines it by its own codes.
+  [[nodiscard]] virtual ZARK_FAILURE_KIND
+  FailureKind(const RouterResult &result) const;
+
+  // The longest one request waits for the router's answer, in seconds.
+  [[nodiscard]] virtual int AnswerDeadlineSeconds() const = 0;
 
   // The router's address on the internet side. kOk (address set), kRefused,
   // kNoAnswer, kBadReply, kNoRouter, kFailed.

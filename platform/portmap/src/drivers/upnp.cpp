@@ -3,7 +3,16 @@
 #include "base/portmap_log.h"
 #include "drivers/driver_log.h"
 
+// The miniupnpc library is built as C99, where UNSIGNED_INTEGER is unsigned
+// long long. A C++ compiler defines no __STDC_VERSION__, so the header would
+// make it unsigned int and read struct PortMapping (its leaseTime, and every
+// field after it) at the wrong offsets: every listed entry came out empty.
+#include <miniupnpc/miniupnpctypes.h>
+#undef UNSIGNED_INTEGER
+#define UNSIGNED_INTEGER unsigned long long
+
 #include <miniupnpc/miniupnpc.h>
+#include <miniupnpc/portlistingparse.h>
 #include <miniupnpc/upnpcommands.h>
 #include <miniupnpc/upnperrors.h>
 #include <syslog.h>
@@ -376,7 +385,7 @@ RouterResult UpnpRouter::TryRootDescription(const std::string &url) {
   return result;
 }
 
-RouterResult UpnpRouter::AddPortMapping(const PortMapping &mapping) {
+RouterResult UpnpRouter::SendAdd(const PortMapping &mapping) {
   RouterResult opened = Open();
   if (!opened.Ok()) {
     return opened;
@@ -407,10 +416,33 @@ RouterResult UpnpRouter::AddPortMapping(const PortMapping &mapping) {
     }
     return added;
   }
+  if (added.Ok()) {
+    mLeaseKind = kind;
+  }
+  return added;
+}
+
+bool UpnpRouter::CanListRanges() const {
+  // WANIPConnection:2 and later have GetListOfPortMappings.
+  return mServiceType.size() > 2 &&
+         mServiceType.compare(mServiceType.size() - 2, 2, ":1") != 0;
+}
+
+RouterResult UpnpRouter::AddPortMappingUnconfirmed(const PortMapping &mapping) {
+  RouterResult opened = Open();
+  if (!opened.Ok()) {
+    return opened;
+  }
+  return CanListRanges() ? SendAdd(mapping) : AddPortMapping(mapping);
+}
+
+RouterResult UpnpRouter::AddPortMapping(const PortMapping &mapping) {
+  RouterResult added = SendAdd(mapping);
   if (!added.Ok()) {
     return added;
   }
-  mLeaseKind = kind;
+  const std::string external = std::to_string(mapping.externalPort);
+  const char *protocol = UpnpProtocolName(mapping.protocol);
 
   // Some routers answer success and drop the mapping (a full table), or
   // answer with a body that miniupnpc reads as success: look.
@@ -573,6 +605,103 @@ RouterResult UpnpRouter::ListMappings(std::vector<RouterMapping> &entries) {
                    " mappings only";
   ZARK_PM_LOG_ERROR("%s", capped.message.c_str());
   return capped;
+}
+
+ZARK_FAILURE_KIND UpnpRouter::FailureKind(const RouterResult &result) const {
+  switch (result.code) {
+  case kUpnpConflictInMappingEntry:
+  case kUpnpConflictWithOtherMechanisms:
+    return ZARK_FAILURE_CONFLICT;
+  case kUpnpNoPortMapsAvailable:
+    return ZARK_FAILURE_TABLE_FULL;
+  case kUpnpOnlyPermanentLeases:
+    return ZARK_FAILURE_LEASE_REFUSED;
+  case kUpnpNotAuthorized:
+  case kUpnpSamePortValuesRequired:
+  case kUpnpWildcardExternalPort:
+    return ZARK_FAILURE_PORT_REFUSED;
+  default:
+    return RouterDriver::FailureKind(result);
+  }
+}
+
+static_assert(sizeof(::PortMapping::leaseTime) == sizeof(unsigned long long),
+              "miniupnpc's listing entries must be read with its C99 layout");
+
+RouterResult UpnpRouter::ListPortRange(IpProtocol protocol, uint16_t firstPort,
+                                       uint16_t lastPort,
+                                       std::vector<RouterMapping> &entries) {
+  entries.clear();
+  RouterResult opened = Open();
+  if (!opened.Ok()) {
+    return opened;
+  }
+  if (!CanListRanges()) {
+    return RouterDriver::ListPortRange(protocol, firstPort, lastPort, entries);
+  }
+  // One page per request; a router sends at most the number asked (and
+  // miniupnpd at most 1000 whatever is asked), so a full page asks again
+  // from the port after its last entry. Bounded: 65536 ports, 1000 a page.
+  constexpr int kPageEntries = 1000;
+  const std::string page = std::to_string(kPageEntries);
+  uint32_t start = firstPort;
+  RouterResult result;
+  for (int request = 0; request < 66 && start <= lastPort; ++request) {
+    const std::string startText = std::to_string(start);
+    const std::string endText = std::to_string(lastPort);
+    PortMappingParserData data{};
+    int rc = UPNP_GetListOfPortMappings(
+        mControlUrl.c_str(), mServiceType.c_str(), startText.c_str(),
+        endText.c_str(), UpnpProtocolName(protocol), page.c_str(), &data);
+    std::unique_ptr<PortMappingParserData, void (*)(PortMappingParserData *)>
+        owner(&data, FreePortListing);
+    if (rc == kUpnpPortMappingNotFound) {
+      LogRouterCall(__FILE__, __LINE__, "UPNP_GetListOfPortMappings", rc, false,
+                    "", startText + "-" + endText + ": no more mappings");
+      break;
+    }
+    result = ZARK_PM_CLASSIFY("UPNP_GetListOfPortMappings", rc,
+                              std::string(UpnpProtocolName(protocol)) + " " +
+                                  startText + "-" + endText);
+    if (!result.Ok()) {
+      entries.clear();
+      return result;
+    }
+    int count = 0;
+    uint32_t highest = 0;
+    for (const ::PortMapping *item = data.l_head; item != nullptr;
+         item = item->l_next) {
+      ++count;
+      std::optional<IpProtocol> itemProtocol =
+          ParseProtocolText(item->protocol);
+      if (!itemProtocol || *itemProtocol != protocol ||
+          item->externalPort == 0 || item->externalPort < start) {
+        continue;
+      }
+      RouterMapping entry;
+      entry.protocol = protocol;
+      entry.externalPort = item->externalPort;
+      entry.internalPort = item->internalPort;
+      entry.internalClient = item->internalClient;
+      entry.description = item->description;
+      entry.leaseSeconds = static_cast<uint32_t>(item->leaseTime);
+      entry.enabled = item->enabled != 0;
+      highest = std::max<uint32_t>(highest, item->externalPort);
+      entries.push_back(std::move(entry));
+    }
+    if (count < kPageEntries || highest == 0) {
+      break;
+    }
+    start = highest + 1;
+  }
+  std::sort(entries.begin(), entries.end(),
+            [](const RouterMapping &a, const RouterMapping &b) {
+              return a.externalPort < b.externalPort;
+            });
+  result.outcome = RouterOutcome::kOk;
+  result.code = 0;
+  result.message = std::to_string(entries.size()) + " mapping(s) listed";
+  return result;
 }
 
 RouterResult UpnpRouter::GetExternalAddress(std::string &address) {

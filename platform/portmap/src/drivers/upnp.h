@@ -38,6 +38,7 @@ enum UpnpErrorCode : int {
                                           // answer it to lease 0 as well)
   kUpnpNoPortMapsAvailable = 728,         // the router's table is full
   kUpnpConflictWithOtherMechanisms = 729, // a port the router itself uses
+  kUpnpPortMappingNotFound = 730, // GetListOfPortMappings: none in the range
 };
 
 // How long a mapping is asked for.
@@ -86,6 +87,17 @@ public:
   [[nodiscard]] RouterResult
   ListMappings(std::vector<RouterMapping> &entries) override;
   [[nodiscard]] RouterResult GetExternalAddress(std::string &address) override;
+  // IGD:2 only (GetListOfPortMappings).
+  [[nodiscard]] RouterResult
+  ListPortRange(IpProtocol protocol, uint16_t firstPort, uint16_t lastPort,
+                std::vector<RouterMapping> &entries) override;
+  // IGD:2 only; IGD:1 routers cannot list, so their adds are read back.
+  [[nodiscard]] RouterResult
+  AddPortMappingUnconfirmed(const PortMapping &mapping) override;
+  [[nodiscard]] ZARK_FAILURE_KIND
+  FailureKind(const RouterResult &result) const override;
+  // miniupnpc's 3 s to connect and 5 s of silence.
+  [[nodiscard]] int AnswerDeadlineSeconds() const override { return 8; }
 
   // The kind of lease the router took last (remembered for the next job).
   [[nodiscard]] LeaseKind CurrentLeaseKind() const { return mLeaseKind; }
@@ -104,6 +116,10 @@ public:
 
 private:
   RouterResult TryRootDescription(const std::string &url);
+  // AddPortMapping's request (a second try with the other kind of lease on
+  // 725 or 402), without reading the mapping back.
+  RouterResult SendAdd(const PortMapping &mapping);
+  [[nodiscard]] bool CanListRanges() const;
 
   UpnpOptions mOptions;
   std::vector<Ipv4Network> mNetworks;
