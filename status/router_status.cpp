@@ -93,13 +93,19 @@ bool ReadPortMapStatus(const std::string &gateway, Json::Value &status,
   return true;
 }
 
-// The failure of the last job in a status, or null.
+// The failure of the last job in a status, or null: also when the job's
+// failure record says none (kind 0, no code).
 Json::Value LastFailure(const Json::Value &status) {
   const Json::Value &job = status["last_job"];
   if (!job.isObject() || !job["failure"].isObject()) {
     return Json::Value();
   }
-  return job["failure"];
+  const Json::Value &failure = job["failure"];
+  if (failure["kind"].asInt() == ZARK_FAILURE_NONE &&
+      failure["code"].asString().empty()) {
+    return Json::Value();
+  }
+  return failure;
 }
 
 bool ParseProtocol(const Json::Value &value, std::string &protocol) {

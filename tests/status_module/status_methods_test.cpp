@@ -247,6 +247,18 @@ TEST_F(StatusMethods, RuleStatusWithoutAnyJobHasNoLastFailure) {
   EXPECT_TRUE(answer["data"]["last_failure"].isNull());
 }
 
+TEST_F(StatusMethods, RuleStatusCountsAFailureOfKindNoneAsNoFailure) {
+  Fake().portMapStatus =
+      R"json({"protocol": "upnp", "rules": [],
+              "last_job": {"kind": "save", "ended": 1764000000, "ok": true,
+                           "failure": {"code": "", "kind": 0,
+                                       "reason": ""}}})json";
+  Json::Value answer = Call("rule_status");
+  ASSERT_TRUE(answer["success"].asBool()) << answer;
+  EXPECT_EQ(answer["data"]["last_job"]["kind"], "save");
+  EXPECT_TRUE(answer["data"]["last_failure"].isNull()) << answer;
+}
+
 TEST_F(StatusMethods, RuleStatusRefusesTextThatIsNotJson) {
   Fake().portMapStatus = "{\"rules\": [";
   Json::Value answer = Call("rule_status");

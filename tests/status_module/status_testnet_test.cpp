@@ -2,7 +2,9 @@
 // library), served by a host in the server namespace of a test network with
 // the real miniupnpd: after the router restarts with its mappings lost, the
 // keeper restores them within one check interval, without any save; the
-// router's table over HTTP marks them ours.
+// router's table over HTTP marks ours and another program's apart; delete
+// refuses the other program's mapping and removes ours; repair restores a
+// mapping deleted on the router; every rule's state is told.
 #include "hermetic.h"
 #include "libzarkportmap.h"
 #include "status_host_fixture.h"
@@ -13,6 +15,7 @@
 
 #include <cstring>
 #include <filesystem>
+#include <map>
 #include <set>
 #include <thread>
 #include <tuple>
@@ -147,6 +150,81 @@ TEST_F(StatusTestnet, KeeperRestoresWhatARestartedRouterLostWithoutASave) {
     ours += mapping["ours"].asBool() ? 1 : 0;
   }
   EXPECT_EQ(ours, 2) << table;
+}
+
+TEST_F(StatusTestnet, TableDeleteRepairAndRuleStateOnTheRealRouter) {
+  ConfigureUpnpRouter();
+  SaveTwoRules();
+  // Another program of this server maps TCP 19000 itself.
+  std::string output;
+  ASSERT_EQ(0, zark::testnet::RunTool({"/usr/bin/upnpc", "-u", mNet.rootDesc,
+                                       "-e", "other program", "-a",
+                                       mNet.lanServer, "9000", "19000", "TCP"},
+                                      output))
+      << output;
+  StartHost(STATUS_MODULE, 300);
+
+  Json::Value table = Call("router_mappings");
+  ASSERT_TRUE(table["success"].asBool()) << table;
+  std::map<int, Json::Value> byPort;
+  for (const Json::Value &mapping : table["data"]["mappings"]) {
+    byPort[mapping["external_port"].asInt()] = mapping;
+  }
+  ASSERT_EQ(byPort.size(), 3u) << table;
+  EXPECT_TRUE(byPort[18080]["ours"].asBool());
+  EXPECT_TRUE(byPort[15000]["ours"].asBool());
+  EXPECT_EQ(byPort[15000]["protocol"], "UDP");
+  EXPECT_EQ(byPort[18080]["internal_client"], mNet.lanServer);
+  EXPECT_FALSE(byPort[19000]["ours"].asBool());
+  EXPECT_EQ(byPort[19000]["description"], "other program");
+
+  // The other program's mapping is refused and stays.
+  Json::Value refused =
+      Call("delete_mapping", "&protocol=TCP&external_port=19000");
+  EXPECT_EQ(Code(refused), 1605) << refused;
+  EXPECT_FALSE(refused["error"]["errors"]["reason"].asString().empty());
+  EXPECT_EQ(RouterHolds().count({"TCP", 19000, 9000}), 1u);
+
+  // A mapping deleted on the router comes back with a repair.
+  ASSERT_EQ(0, zark::testnet::RunTool({"/usr/bin/upnpc", "-u", mNet.rootDesc,
+                                       "-d", "18080", "TCP"},
+                                      output))
+      << output;
+  ASSERT_EQ(RouterHolds().count({"TCP", 18080, 8080}), 0u);
+  Json::Value start = Call("repair");
+  ASSERT_TRUE(start["success"].asBool()) << start;
+  Json::Value repaired = PollUntil(
+      "repair_status",
+      "&task_id=" +
+          zark::host::test::FormEncode(start["data"]["task_id"].asString()),
+      [](const Json::Value &a) {
+        return !a["success"].asBool() || a["data"]["finish"].asBool();
+      },
+      60s);
+  ASSERT_TRUE(repaired["success"].asBool()) << repaired;
+  EXPECT_EQ(repaired["data"]["percentage"], 100);
+  EXPECT_EQ(repaired["data"]["repaired"], 1) << repaired;
+  EXPECT_EQ(RouterHolds().count({"TCP", 18080, 8080}), 1u);
+
+  // Every saved rule's state, from the library's record.
+  Json::Value status = Call("rule_status");
+  ASSERT_TRUE(status["success"].asBool()) << status;
+  EXPECT_EQ(status["data"]["protocol"], "upnp") << status;
+  ASSERT_EQ(status["data"]["rules"].size(), 2u) << status;
+  for (const Json::Value &rule : status["data"]["rules"]) {
+    EXPECT_EQ(rule["state"], "on_router") << status;
+    EXPECT_GT(rule["verified"].asInt64(), 0) << status;
+  }
+  EXPECT_TRUE(status["data"]["last_failure"].isNull()) << status;
+
+  // Ours is deleted on request.
+  Json::Value deleted =
+      Call("delete_mapping", "&protocol=TCP&external_port=18080");
+  ASSERT_TRUE(deleted["success"].asBool()) << deleted;
+  Held held = RouterHolds();
+  EXPECT_EQ(held.count({"TCP", 18080, 8080}), 0u);
+  EXPECT_EQ(held.count({"UDP", 15000, 5000}), 1u);
+  EXPECT_EQ(held.count({"TCP", 19000, 9000}), 1u);
 }
 
 } // namespace
