@@ -390,13 +390,14 @@ TEST_P(StatusRefusals, NonAdministratorIs105) {
   EXPECT_EQ(LibraryCalls(), before);
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    EveryMethod, StatusRefusals, ::testing::ValuesIn(kMethods),
-    [](const ::testing::TestParamInfo<MethodCase> &info) {
-      std::string name = info.param.method;
-      name.erase(std::remove(name.begin(), name.end(), '_'), name.end());
-      return name;
-    });
+INSTANTIATE_TEST_SUITE_P(Status, StatusRefusals, ::testing::ValuesIn(kMethods),
+                         [](const ::testing::TestParamInfo<MethodCase> &info) {
+                           std::string name = info.param.method;
+                           name.erase(
+                               std::remove(name.begin(), name.end(), '_'),
+                               name.end());
+                           return name;
+                         });
 
 } // namespace
 } // namespace zark::status::test
