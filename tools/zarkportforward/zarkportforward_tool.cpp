@@ -63,7 +63,8 @@ int Apply(const std::string &gateway, bool renew, std::ostream &out,
   }
   out << (renew ? "renew" : "apply") << ": " << summary.deleted << " deleted, "
       << summary.added << " added, " << summary.checked << " checked, "
-      << summary.unchanged << " unchanged, " << summary.failed << " failed\n";
+      << summary.unchanged << " unchanged, " << summary.failed << " failed, "
+      << summary.repaired << " repaired\n";
   if (rc == 0) {
     return kToolOk;
   }

@@ -244,6 +244,15 @@ int KLibGetRulesArrFromTestRuleConf(int *count, ZARK_ROUTER_RULE **rules,
 void KLibFreeRulesArr(ZARK_ROUTER_RULE *rules);
 
 // --- Applying rules ---------------------------------------------------------
+// Checks the rules, stores them as the saved rule configuration, then
+// applies them to the router configured for gatewayIP, verifying what the
+// router really holds and restoring what it lost (flag is no longer
+// looked at: every save verifies). A rule set refused by the checks
+// (errType 7..12) or without a configured router (2) is not stored; a set
+// that the router then fails to take in full stays stored, each mapping
+// marked with its state and reason (KLibGetPortMapStatus), and -1 is
+// returned with errType ZARK_PORTMAP_ERR_ROUTER (or _IO, _GENERIC) and
+// detail.text naming the failure in words.
 int KLibSaveRules(const char *gatewayIP, int count, ZARK_ROUTER_RULE *rules,
                   bool flag, ZARK_ROUTER_SAVE_RULE_RESULT *result,
                   ZARK_SAVE_RULE_PROGRESS_CB callback, void *arg);

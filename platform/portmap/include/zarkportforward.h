@@ -30,7 +30,8 @@ typedef struct {
 // Applies the saved rule configuration (ZARK_PORTMAP_RULE_CONF) to the
 // router configured for gatewayIP: deletes the mappings no longer wanted,
 // adds the missing ones, asks the router about the others and adds again
-// those it lost, and refreshes leases that end within 45 minutes. The saved
+// those it lost (summary->repaired), and refreshes leases that end within
+// 45 minutes (the keeper, KLibKeepRouter, renews at half the lease). The saved
 // rule configuration itself is not rewritten. renew false writes
 // ZARK_PORTMAP_APPLY_PROGRESS as the job goes; renew true (the timer's
 // job) does not.

@@ -145,8 +145,7 @@ TEST_F(PortMapApplyRouterTruth, AnUnchangedSaveRestoresWhatTheRouterLost) {
   ASSERT_EQ(0, Save(FiveMappings())) << mResult.detail.text;
 
   // Each mapping looked up, the two lost ones added and confirmed.
-  EXPECT_EQ((std::map<std::string, int>{{"GET", 1},
-                                        {"AddPortMapping", 2},
+  EXPECT_EQ((std::map<std::string, int>{{"AddPortMapping", 2},
                                         {"GetSpecificPortMappingEntry", 7}}),
             mIgd.Counts());
   EXPECT_EQ(5u, mIgd.Table().size());
@@ -234,12 +233,54 @@ TEST_F(PortMapApplyRouterTruth, AForeignMappingIsLeftAloneAndNamed) {
                 rule["reason"].asString().find("game console"));
     }
   }
+  // The live table marks the foreign mapping as not ours.
+  ZARK_ROUTER_MAPPINGS live{};
+  ZARK_LIBZARKPORTMAP_ERR err{};
+  ASSERT_EQ(0, KLibListRouterMappings(kGateway, &live, &err)) << live.message;
+  ASSERT_EQ(5, live.count);
+  for (int i = 0; i < live.count; ++i) {
+    const ZARK_ROUTER_MAPPING &entry = live.mappings[i];
+    EXPECT_EQ(entry.external_port == 2222 ? 0 : 1, entry.ours)
+        << entry.external_port;
+    EXPECT_EQ(1, entry.enabled);
+  }
+  KLibFreeRouterMappings(&live);
   // A repair tries again and still leaves it alone.
   ZARK_PORTMAP_APPLY_SUMMARY summary{};
   EXPECT_EQ(
       -1, KLibRepairSavedRules(kGateway, &summary, nullptr, nullptr, nullptr));
   EXPECT_EQ(1, summary.failed);
   EXPECT_EQ("127.0.0.9", mIgd.Table()[0].client);
+}
+
+TEST_F(PortMapApplyRouterTruth, TheControlUrlIsRememberedUntilItFails) {
+  ASSERT_EQ(0, Save(FiveMappings())) << mResult.detail.text;
+  EXPECT_EQ(1, mIgd.Count("GET"));
+  // The router restarted with its service somewhere else; the old control
+  // URL no longer answers.
+  mIgd.SetControlUrl("/ctl/Moved");
+  mIgd.OnAction("GetSpecificPortMappingEntry", [](const SoapRequest &request) {
+    std::optional<HttpReply> reply;
+    if (request.path != "/ctl/Moved") {
+      reply.emplace();
+      reply->close = true;
+    }
+    return reply;
+  });
+  mIgd.ResetCounts();
+
+  ASSERT_EQ(0, Save(FiveMappings())) << mResult.detail.text;
+
+  // One failed lookup, the description fetched again, then the five.
+  EXPECT_EQ((std::map<std::string, int>{{"GET", 1},
+                                        {"GetSpecificPortMappingEntry", 6}}),
+            mIgd.Counts());
+  EXPECT_EQ("http://127.0.0.1:" + std::to_string(mIgd.Port()) + "/ctl/Moved",
+            Record().controlUrl);
+  mIgd.ResetCounts();
+  ASSERT_EQ(0, Save(FiveMappings())) << mResult.detail.text;
+  EXPECT_EQ(0, mIgd.Count("GET"));
+  EXPECT_EQ(5, mIgd.Count("GetSpecificPortMappingEntry"));
 }
 
 // The same against an IGD:2 router, which lists a port range in one request.
@@ -266,6 +307,8 @@ TEST_F(PortMapApplyRouterTruthIgd2, ListingsVerifyAndConfirmTwoHundred) {
 
   mIgd.ResetCounts();
   ASSERT_EQ(0, Save(TwoHundredMappings())) << mResult.detail.text;
+  // An unchanged save of 200 mappings: two requests in all.
+  EXPECT_EQ(2, mIgd.TotalRequests());
   EXPECT_EQ(2, mIgd.Count("GetListOfPortMappings"));
   EXPECT_EQ(0, mIgd.Count("AddPortMapping"));
   EXPECT_EQ(0, mIgd.Count("GetSpecificPortMappingEntry"));
@@ -281,8 +324,7 @@ TEST_F(PortMapApplyRouterTruthIgd2, ListingsVerifyAndConfirmTwoHundred) {
   }
   mIgd.ResetCounts();
   ASSERT_EQ(0, Save(TwoHundredMappings())) << mResult.detail.text;
-  EXPECT_EQ((std::map<std::string, int>{{"GET", 1},
-                                        {"GetListOfPortMappings", 3},
+  EXPECT_EQ((std::map<std::string, int>{{"GetListOfPortMappings", 3},
                                         {"AddPortMapping", 2}}),
             mIgd.Counts());
   EXPECT_EQ(200u, mIgd.Table().size());

@@ -85,7 +85,11 @@ int ListMappings(const std::string &gateway, ZARK_ROUTER_MAPPINGS &out,
     CopyText(out.location, gateway);
     if (record != nullptr) {
       for (const RecordedMapping &mapping : record->mappings) {
+        if (mapping.apply == MappingApply::kRefused) {
+          continue; // the router refused it: not in its table
+        }
         ZARK_ROUTER_MAPPING &entry = AddEntry(entries, mapping);
+        entry.enabled = 1;
         entry.ours = 1;
         entry.held = mapping.held ? 1 : 0;
         CopyText(entry.rule_id, mapping.ruleId);
@@ -100,11 +104,14 @@ int ListMappings(const std::string &gateway, ZARK_ROUTER_MAPPINGS &out,
     for (const RouterMapping &mapping : listed) {
       ZARK_ROUTER_MAPPING &entry = AddEntry(entries, mapping);
       CopyText(entry.description, mapping.description);
+      entry.enabled = mapping.enabled ? 1 : 0;
       const RecordedMapping *ours =
           record != nullptr
               ? record->Find(mapping.protocol, mapping.externalPort)
               : nullptr;
-      if (ours != nullptr) {
+      // A port we were refused is held by another mapping: not ours.
+      if (ours != nullptr && ours->apply != MappingApply::kRefused &&
+          ours->internalClient == mapping.internalClient) {
         entry.ours = 1;
         entry.held = ours->held ? 1 : 0;
         CopyText(entry.rule_id, ours->ruleId);

@@ -1000,6 +1000,8 @@ int Applier::Run(std::span<const ZARK_ROUTER_RULE> rules,
     if (!location.empty()) {
       Record().location = location;
       Record().finiteLeases = router->FiniteLeases();
+      Record().controlUrl = router->ControlUrl();
+      Record().serviceType = router->ServiceType();
     }
     RecordLastJob();
     mRouter = nullptr;

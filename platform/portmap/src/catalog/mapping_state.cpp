@@ -15,10 +15,8 @@
 namespace zark::portmap {
 namespace {
 
-// Every port of both protocols on one router, each entry written with its
-// longest rule id and reason (about 600 bytes pretty-printed), fits.
-constexpr Json::ArrayIndex kMaxMappings = 2 * 65535;
-constexpr std::size_t kMaxStateBytes = 128u << 20;
+constexpr Json::ArrayIndex kMaxMappings = kMaxRecordedMappings;
+constexpr std::size_t kMaxStateBytes = kMaxMappingStateBytes;
 constexpr Json::ArrayIndex kMaxRouters = 64;
 
 constexpr MappingApply kApplyStates[] = {
@@ -186,6 +184,8 @@ bool ReadRouter(const Json::Value &value, int version, RouterRecord &router,
   router.protocol = *parsed;
   if (version >= 2) {
     if (!ReadString(value, "external_address", router.externalAddress, why) ||
+        !ReadString(value, "control_url", router.controlUrl, why) ||
+        !ReadString(value, "service_type", router.serviceType, why) ||
         !ReadLastJob(value["last_job"], router.lastJob, why)) {
       return false;
     }
@@ -208,7 +208,7 @@ bool ReadRouter(const Json::Value &value, int version, RouterRecord &router,
     if (router.Find(mapping.protocol, mapping.externalPort) != nullptr) {
       return Fail(why, "a mapping is listed twice");
     }
-    router.mappings.push_back(std::move(mapping));
+    router.Put(mapping);
   }
   return true;
 }
@@ -273,34 +273,67 @@ const char *MappingApplyWord(MappingApply apply) {
   return "pending";
 }
 
+namespace {
+
+uint32_t PortKey(IpProtocol protocol, uint16_t externalPort) {
+  return (static_cast<uint32_t>(protocol) << 16) | externalPort;
+}
+
+} // namespace
+
+std::size_t RouterRecord::IndexOf(IpProtocol protocol,
+                                  uint16_t externalPort) const {
+  auto matches = [&](std::size_t i) {
+    return i < mappings.size() && mappings[i].protocol == protocol &&
+           mappings[i].externalPort == externalPort;
+  };
+  const uint32_t key = PortKey(protocol, externalPort);
+  auto found = mIndex.find(key);
+  if (found != mIndex.end() && matches(found->second)) {
+    return found->second;
+  }
+  if (found == mIndex.end() && mIndex.size() == mappings.size()) {
+    return mappings.size(); // the index covers the list: not there
+  }
+  mIndex.clear();
+  for (std::size_t i = 0; i < mappings.size(); ++i) {
+    mIndex.emplace(PortKey(mappings[i].protocol, mappings[i].externalPort), i);
+  }
+  found = mIndex.find(key);
+  return found != mIndex.end() ? found->second : mappings.size();
+}
+
 RecordedMapping *RouterRecord::Find(IpProtocol protocol,
                                     uint16_t externalPort) {
-  for (RecordedMapping &mapping : mappings) {
-    if (mapping.protocol == protocol && mapping.externalPort == externalPort) {
-      return &mapping;
-    }
-  }
-  return nullptr;
+  const std::size_t i = IndexOf(protocol, externalPort);
+  return i < mappings.size() ? &mappings[i] : nullptr;
 }
 
 const RecordedMapping *RouterRecord::Find(IpProtocol protocol,
                                           uint16_t externalPort) const {
-  return const_cast<RouterRecord *>(this)->Find(protocol, externalPort);
+  const std::size_t i = IndexOf(protocol, externalPort);
+  return i < mappings.size() ? &mappings[i] : nullptr;
 }
 
 void RouterRecord::Put(const RecordedMapping &mapping) {
   if (RecordedMapping *existing =
           Find(mapping.protocol, mapping.externalPort)) {
     *existing = mapping;
-  } else {
-    mappings.push_back(mapping);
+    return;
+  }
+  mappings.push_back(mapping);
+  if (mIndex.size() + 1 == mappings.size()) {
+    mIndex.emplace(PortKey(mapping.protocol, mapping.externalPort),
+                   mappings.size() - 1);
   }
 }
 
 void RouterRecord::Remove(IpProtocol protocol, uint16_t externalPort) {
-  std::erase_if(mappings, [&](const RecordedMapping &mapping) {
-    return mapping.protocol == protocol && mapping.externalPort == externalPort;
-  });
+  const std::size_t i = IndexOf(protocol, externalPort);
+  if (i < mappings.size()) {
+    mappings.erase(mappings.begin() + static_cast<std::ptrdiff_t>(i));
+    mIndex.clear(); // positions after i moved; rebuilt on the next lookup
+  }
 }
 
 RouterRecord *MappingState::Find(std::string_view gateway,
@@ -341,6 +374,8 @@ std::string SerializeMappingState(const MappingState &state) {
     item["location"] = router.location;
     item["finite_leases"] = router.finiteLeases;
     item["external_address"] = router.externalAddress;
+    item["control_url"] = router.controlUrl;
+    item["service_type"] = router.serviceType;
     if (router.lastJob) {
       const LastJob &job = *router.lastJob;
       Json::Value last(Json::objectValue);

@@ -11,6 +11,8 @@
 //       "gateway" : "192.168.1.1", "protocol" : "upnp",
 //       "location" : "http://192.168.1.1:5000/rootDesc.xml",
 //       "finite_leases" : false, "external_address" : "203.0.113.7",
+//       "control_url" : "http://192.168.1.1:5000/ctl/IPConn",
+//       "service_type" : "urn:schemas-upnp-org:service:WANIPConnection:2",
 //       "last_job" : { "kind" : "save", "ended" : 1700000000, "ok" : false,
 //                      "repaired" : 0, "added" : 1, "deleted" : 0,
 //                      "failure" : "conflict", "reason" : "words" },
@@ -21,10 +23,12 @@
 //         "failure" : "", "reason" : "", "verified" : 1700000000 } ] } ]
 //   }
 //
-// "last_job" may be null. Version 1 files (without "external_address",
-// "last_job" and the mappings' "state", "failure", "reason", "verified")
-// are read too: a held mapping is then "on_router", another "pending", and
-// none was verified.
+// "control_url" and "service_type" are where the last job sent its UPnP
+// requests: the next one starts there without fetching the description
+// ("" for NAT-PMP). "last_job" may be null. Version 1 files (without
+// "external_address", "last_job" and the mappings' "state", "failure",
+// "reason", "verified") are read too: a held mapping is then "on_router",
+// another "pending", and none was verified.
 //
 // "held" true: the router was seen to hold the mapping. false: it may or may
 // not (a request was under way when the job stopped, or the router stopped
@@ -49,6 +53,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 #include <vector>
 
 namespace zark::portmap {
@@ -56,6 +61,13 @@ namespace zark::portmap {
 inline constexpr const char *kMappingStatePath =
     ZARK_PORTMAP_CONF_DIR "/mappings.json";
 inline constexpr int kMappingStateVersion = 2;
+// The most mappings one router's record holds: every port of both
+// protocols, the largest rule set the library accepts.
+inline constexpr std::size_t kMaxRecordedMappings = 2 * 65535;
+// The largest state file read: the most mappings of one router, each with
+// a rule id and a reason of 200 bytes, fit (about 825 bytes an entry as
+// written).
+inline constexpr std::size_t kMaxMappingStateBytes = 128u << 20;
 
 // Where a wanted mapping stands with the router.
 enum class MappingApply : uint8_t { kOnRouter, kMissing, kRefused, kPending };
@@ -100,12 +112,22 @@ struct RouterRecord {
   std::string location;                            // RouterDriver::Location()
   bool finiteLeases = false;
   std::string externalAddress; // "" unknown
+  std::string controlUrl;      // RouterDriver::ControlUrl()
+  std::string serviceType;     // RouterDriver::ServiceType()
   std::optional<LastJob> lastJob;
   std::vector<RecordedMapping> mappings;
 
-  friend bool operator==(const RouterRecord &, const RouterRecord &) = default;
+  // Equal content; the lookup index is not content.
+  friend bool operator==(const RouterRecord &a, const RouterRecord &b) {
+    return a.gateway == b.gateway && a.protocol == b.protocol &&
+           a.location == b.location && a.finiteLeases == b.finiteLeases &&
+           a.externalAddress == b.externalAddress &&
+           a.controlUrl == b.controlUrl && a.serviceType == b.serviceType &&
+           a.lastJob == b.lastJob && a.mappings == b.mappings;
+  }
 
-  // The mapping of externalPort/protocol, or null.
+  // The mapping of externalPort/protocol, or null. Keyed (not a search of
+  // the list): a save of many mappings looks each up several times.
   [[nodiscard]] RecordedMapping *Find(IpProtocol protocol,
                                       uint16_t externalPort);
   [[nodiscard]] const RecordedMapping *Find(IpProtocol protocol,
@@ -114,6 +136,13 @@ struct RouterRecord {
   void Put(const RecordedMapping &mapping);
   // Removes the mapping of externalPort/protocol, if any.
   void Remove(IpProtocol protocol, uint16_t externalPort);
+
+private:
+  // Position in mappings by protocol and port, rebuilt when it no longer
+  // matches the list (a caller may change the list directly).
+  [[nodiscard]] std::size_t IndexOf(IpProtocol protocol,
+                                    uint16_t externalPort) const;
+  mutable std::unordered_map<uint32_t, std::size_t> mIndex;
 };
 
 struct MappingState {

@@ -200,6 +200,8 @@ std::unique_ptr<RouterDriver> MakeRouter(RouterProtocol protocol,
     options.gateway = gateway;
     if (memo != nullptr && !memo->location.empty()) {
       options.knownRootDescUrls.push_back(memo->location);
+      options.knownControlUrl = memo->controlUrl;
+      options.knownServiceType = memo->serviceType;
     }
     if (memo != nullptr && memo->finiteLeases) {
       options.firstLease = LeaseKind::kFinite;

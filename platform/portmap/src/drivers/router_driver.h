@@ -74,6 +74,12 @@ public:
   // root description URL; NAT-PMP: the gateway address). Empty before Open.
   [[nodiscard]] virtual std::string Location() const = 0;
 
+  // Where requests go, for the next job to start from without fetching the
+  // router's description (UPnP: the control URL and service type); empty
+  // when the protocol has no such thing or before Open.
+  [[nodiscard]] virtual std::string ControlUrl() const { return {}; }
+  [[nodiscard]] virtual std::string ServiceType() const { return {}; }
+
   // Adds a mapping and makes sure the router holds it. kOk (leaseSeconds
   // set), kConflict, kNotHeld, kRefused, kNoAnswer, kBadReply, kNoRouter,
   // kFailed.

@@ -185,6 +185,31 @@ RouterResult UpnpRouter::Open() {
       mOptions.localNetworks ? *mOptions.localNetworks : InterfaceNetworks();
   mGateway = ParseIpv4(mOptions.gateway);
 
+  // Only a control point on the local network, as a fresh description's
+  // would have to be (ServicesOnLocalNetwork): the state file is no proof.
+  if (!mMemoTried && !mOptions.knownControlUrl.empty() &&
+      !mOptions.knownServiceType.empty() &&
+      !mOptions.knownRootDescUrls.empty() &&
+      IsUrlOnLocalNetwork(mOptions.knownRootDescUrls.front(), mNetworks,
+                          mGateway) &&
+      IsUrlOnLocalNetwork(mOptions.knownControlUrl, mNetworks, mGateway)) {
+    // The control point the last job used: no description fetch. A request
+    // that fails through it fetches the description again
+    // (ControlUrlWasStale).
+    mMemoTried = true;
+    mFromMemo = true;
+    mRootDescUrl = mOptions.knownRootDescUrls.front();
+    mControlUrl = mOptions.knownControlUrl;
+    mServiceType = mOptions.knownServiceType;
+    mOpen = true;
+    RouterResult remembered;
+    remembered.outcome = RouterOutcome::kOk;
+    remembered.message =
+        "using " + mServiceType + " at " + mControlUrl + " (remembered)";
+    return remembered;
+  }
+  mMemoTried = true;
+
   RouterResult last;
   last.outcome = RouterOutcome::kNoRouter;
   last.message = "no UPnP router found";
@@ -385,7 +410,7 @@ RouterResult UpnpRouter::TryRootDescription(const std::string &url) {
   return result;
 }
 
-RouterResult UpnpRouter::SendAdd(const PortMapping &mapping) {
+RouterResult UpnpRouter::SendAddOnce(const PortMapping &mapping) {
   RouterResult opened = Open();
   if (!opened.Ok()) {
     return opened;
@@ -484,7 +509,7 @@ RouterResult UpnpRouter::AddPortMapping(const PortMapping &mapping) {
   return confirm;
 }
 
-RouterResult UpnpRouter::DeletePortMapping(const PortMapping &mapping) {
+RouterResult UpnpRouter::DeletePortMappingOnce(const PortMapping &mapping) {
   RouterResult opened = Open();
   if (!opened.Ok()) {
     return opened;
@@ -496,9 +521,9 @@ RouterResult UpnpRouter::DeletePortMapping(const PortMapping &mapping) {
   return ZARK_PM_CLASSIFY("UPNP_DeletePortMapping", rc, MappingText(mapping));
 }
 
-RouterResult UpnpRouter::GetSpecificPortMapping(IpProtocol protocol,
-                                                uint16_t externalPort,
-                                                RouterMapping &entry) {
+RouterResult UpnpRouter::GetSpecificPortMappingOnce(IpProtocol protocol,
+                                                    uint16_t externalPort,
+                                                    RouterMapping &entry) {
   RouterResult opened = Open();
   if (!opened.Ok()) {
     return opened;
@@ -544,7 +569,7 @@ RouterResult UpnpRouter::GetSpecificPortMapping(IpProtocol protocol,
   return result;
 }
 
-RouterResult UpnpRouter::ListMappings(std::vector<RouterMapping> &entries) {
+RouterResult UpnpRouter::ListMappingsOnce(std::vector<RouterMapping> &entries) {
   RouterResult opened = Open();
   if (!opened.Ok()) {
     return opened;
@@ -628,9 +653,10 @@ ZARK_FAILURE_KIND UpnpRouter::FailureKind(const RouterResult &result) const {
 static_assert(sizeof(::PortMapping::leaseTime) == sizeof(unsigned long long),
               "miniupnpc's listing entries must be read with its C99 layout");
 
-RouterResult UpnpRouter::ListPortRange(IpProtocol protocol, uint16_t firstPort,
-                                       uint16_t lastPort,
-                                       std::vector<RouterMapping> &entries) {
+RouterResult
+UpnpRouter::ListPortRangeOnce(IpProtocol protocol, uint16_t firstPort,
+                              uint16_t lastPort,
+                              std::vector<RouterMapping> &entries) {
   entries.clear();
   RouterResult opened = Open();
   if (!opened.Ok()) {
@@ -704,7 +730,7 @@ RouterResult UpnpRouter::ListPortRange(IpProtocol protocol, uint16_t firstPort,
   return result;
 }
 
-RouterResult UpnpRouter::GetExternalAddress(std::string &address) {
+RouterResult UpnpRouter::GetExternalAddressOnce(std::string &address) {
   RouterResult opened = Open();
   if (!opened.Ok()) {
     return opened;
@@ -726,6 +752,67 @@ RouterResult UpnpRouter::GetExternalAddress(std::string &address) {
   }
   address = text;
   return result;
+}
+
+bool UpnpRouter::ControlUrlWasStale(const RouterResult &failed) {
+  const bool mayBeStale = failed.outcome == RouterOutcome::kNoAnswer ||
+                          failed.outcome == RouterOutcome::kBadReply ||
+                          failed.code == UPNPCOMMAND_HTTP_ERROR ||
+                          failed.code == kUpnpInvalidAction;
+  if (!mFromMemo || failed.Ok() || !mayBeStale) {
+    return false;
+  }
+  // The remembered control URL failed: the router may have restarted on
+  // another port or path. Fetch its description once; retry only when it
+  // names another control point.
+  mFromMemo = false;
+  mOpen = false;
+  const std::string oldUrl = mControlUrl;
+  const std::string oldType = mServiceType;
+  if (!Open().Ok()) {
+    return false;
+  }
+  return mControlUrl != oldUrl || mServiceType != oldType;
+}
+
+RouterResult UpnpRouter::SendAdd(const PortMapping &mapping) {
+  RouterResult result = SendAddOnce(mapping);
+  return ControlUrlWasStale(result) ? SendAddOnce(mapping) : result;
+}
+
+RouterResult UpnpRouter::DeletePortMapping(const PortMapping &mapping) {
+  RouterResult result = DeletePortMappingOnce(mapping);
+  return ControlUrlWasStale(result) ? DeletePortMappingOnce(mapping) : result;
+}
+
+RouterResult UpnpRouter::GetSpecificPortMapping(IpProtocol protocol,
+                                                uint16_t externalPort,
+                                                RouterMapping &entry) {
+  RouterResult result =
+      GetSpecificPortMappingOnce(protocol, externalPort, entry);
+  return ControlUrlWasStale(result)
+             ? GetSpecificPortMappingOnce(protocol, externalPort, entry)
+             : result;
+}
+
+RouterResult UpnpRouter::ListMappings(std::vector<RouterMapping> &entries) {
+  RouterResult result = ListMappingsOnce(entries);
+  return ControlUrlWasStale(result) ? ListMappingsOnce(entries) : result;
+}
+
+RouterResult UpnpRouter::ListPortRange(IpProtocol protocol, uint16_t firstPort,
+                                       uint16_t lastPort,
+                                       std::vector<RouterMapping> &entries) {
+  RouterResult result =
+      ListPortRangeOnce(protocol, firstPort, lastPort, entries);
+  return ControlUrlWasStale(result)
+             ? ListPortRangeOnce(protocol, firstPort, lastPort, entries)
+             : result;
+}
+
+RouterResult UpnpRouter::GetExternalAddress(std::string &address) {
+  RouterResult result = GetExternalAddressOnce(address);
+  return ControlUrlWasStale(result) ? GetExternalAddressOnce(address) : result;
 }
 
 } // namespace zark::portmap

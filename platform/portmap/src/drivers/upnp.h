@@ -25,6 +25,7 @@ namespace zark::portmap {
 // by the UPnP IGD standard. They are not miniupnpc's own results
 // (UPNPCOMMAND_*, all negative), which miniupnpc names itself.
 enum UpnpErrorCode : int {
+  kUpnpInvalidAction = 401,        // no such action at this control URL
   kUpnpInvalidArgs = 402,          // an argument is wrong; some routers say so
                                    // about the lease duration
   kUpnpActionFailed = 501,         // the router failed to do it
@@ -63,6 +64,11 @@ struct UpnpOptions {
   std::optional<std::vector<Ipv4Network>> localNetworks;
   // The first kind of lease to ask for; the other is tried when the router
   // refuses it with 725 or 402, and then kept for the rest of the job.
+  // The control URL and service type the last job used at
+  // knownRootDescUrls.front(): Open trusts them without fetching the
+  // description until a request through them fails.
+  std::string knownControlUrl;
+  std::string knownServiceType;
   LeaseKind firstLease = LeaseKind::kPermanent;
   uint32_t finiteLeaseSeconds = 3600;
 };
@@ -77,6 +83,7 @@ public:
   }
   [[nodiscard]] RouterResult Open() override;
   [[nodiscard]] std::string Location() const override { return mRootDescUrl; }
+
   [[nodiscard]] RouterResult
   AddPortMapping(const PortMapping &mapping) override;
   [[nodiscard]] RouterResult
@@ -106,8 +113,10 @@ public:
   }
   // The service in use after Open ("urn:...:WANIPConnection:1" ...) and its
   // control URL; empty before.
-  [[nodiscard]] const std::string &ServiceType() const { return mServiceType; }
-  [[nodiscard]] const std::string &ControlUrl() const { return mControlUrl; }
+  [[nodiscard]] std::string ServiceType() const override {
+    return mServiceType;
+  }
+  [[nodiscard]] std::string ControlUrl() const override { return mControlUrl; }
 
   // At most this many entries are read by ListMappings.
   static constexpr int kMaxListedEntries = 1024;
@@ -119,6 +128,21 @@ private:
   // AddPortMapping's request (a second try with the other kind of lease on
   // 725 or 402), without reading the mapping back.
   RouterResult SendAdd(const PortMapping &mapping);
+  // The operations once, through the current control point; the public ones
+  // retry once when ControlUrlWasStale.
+  RouterResult SendAddOnce(const PortMapping &mapping);
+  RouterResult DeletePortMappingOnce(const PortMapping &mapping);
+  RouterResult GetSpecificPortMappingOnce(IpProtocol protocol,
+                                          uint16_t externalPort,
+                                          RouterMapping &entry);
+  RouterResult ListMappingsOnce(std::vector<RouterMapping> &entries);
+  RouterResult ListPortRangeOnce(IpProtocol protocol, uint16_t firstPort,
+                                 uint16_t lastPort,
+                                 std::vector<RouterMapping> &entries);
+  RouterResult GetExternalAddressOnce(std::string &address);
+  // After a failure through a remembered control point: true when a fresh
+  // description names another one (then the request is worth repeating).
+  bool ControlUrlWasStale(const RouterResult &failed);
   [[nodiscard]] bool CanListRanges() const;
 
   UpnpOptions mOptions;
@@ -128,6 +152,8 @@ private:
   std::string mRootDescUrl;
   std::string mControlUrl;
   std::string mServiceType;
+  bool mMemoTried = false; // Open has looked at the remembered control point
+  bool mFromMemo = false;  // the control point is the remembered one
   LeaseKind mLeaseKind;
 };
 
