@@ -175,6 +175,7 @@ TEST_F(StatusTestnet, TableDeleteRepairAndRuleStateOnTheRealRouter) {
   EXPECT_TRUE(byPort[15000]["ours"].asBool());
   EXPECT_EQ(byPort[15000]["protocol"], "UDP");
   EXPECT_EQ(byPort[18080]["internal_client"], mNet.lanServer);
+  EXPECT_TRUE(byPort[18080]["enabled"].asBool());
   EXPECT_FALSE(byPort[19000]["ours"].asBool());
   EXPECT_EQ(byPort[19000]["description"], "other program");
 
