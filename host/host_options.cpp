@@ -112,6 +112,7 @@ enum : int {
   kSessionIdle,
   kSessionMax,
   kSecureCookie,
+  kKeeperInterval,
 };
 
 const option kHostOptions[] = {
@@ -124,6 +125,7 @@ const option kHostOptions[] = {
     {"session-idle", required_argument, nullptr, kSessionIdle},
     {"session-max", required_argument, nullptr, kSessionMax},
     {"secure-cookie", no_argument, nullptr, kSecureCookie},
+    {"keeper-interval", required_argument, nullptr, kKeeperInterval},
     {nullptr, 0, nullptr, 0},
 };
 
@@ -188,6 +190,15 @@ bool ApplyHostOption(int got, const char *value, const std::string &name,
     options.sessions.maxLifetime = *max;
     break;
   }
+  case kKeeperInterval: {
+    auto interval = ParseSeconds(value, name, kMaxKeeperIntervalSeconds, error);
+    if (!interval) {
+      return false;
+    }
+    options.modules.keeper_interval_seconds =
+        static_cast<std::int32_t>(interval->count() / 1000);
+    break;
+  }
   default:
     break;
   }
@@ -195,7 +206,7 @@ bool ApplyHostOption(int got, const char *value, const std::string &name,
 }
 
 bool IsTableOption(int got) {
-  return got >= kListen && got <= kSecureCookie;
+  return got >= kListen && got <= kKeeperInterval;
 }
 
 } // namespace
@@ -267,6 +278,9 @@ std::string HostUsage(std::string_view program) {
          "case (default 43200)\n"
          "  --secure-cookie        mark the session cookie Secure (when "
          "served over HTTPS)\n"
+         "  --keeper-interval SECONDS  how often modules check the router "
+         "for lost\n"
+         "                         mappings, 1 to 86400 (default 300)\n"
          "  --help                 this text\n"
          "\n"
          "passwd reads the password from standard input (twice, without "

@@ -3,6 +3,7 @@
 #define ZARK_HOST_HOST_OPTIONS_H
 
 #include "http_server.h"
+#include "module_lifecycle.h"
 #include "session_store.h"
 
 #include <filesystem>
@@ -24,7 +25,12 @@ struct HostOptions {
   std::filesystem::path accountsFile = DefaultAccountsFile();
   SessionPolicy sessions;
   bool secureCookie = false;
+  // Handed to the modules' start functions (--keeper-interval).
+  ZARK_MODULE_SETTINGS modules = DefaultModuleSettings();
 };
+
+// Longest --keeper-interval: a day.
+inline constexpr std::int64_t kMaxKeeperIntervalSeconds = 24 * 3600;
 
 enum class OptionsResult {
   Run,   // options is filled

@@ -96,6 +96,7 @@ int Serve(const HostOptions &options) {
     HOST_LOG(LOG_WARNING, "no module loaded from %s; serving none",
              options.modulesFolder.c_str());
   }
+  modules.StartModules(options.modules);
   SteadyClock clock;
   SessionStore sessions(clock, options.sessions);
   LoginThrottle throttle(clock, ThrottlePolicy{});
@@ -121,6 +122,7 @@ int Serve(const HostOptions &options) {
   // Module code may still run in task threads: join them before the
   // modules are unloaded (when modules goes out of scope).
   AskTasksToStop();
+  modules.StopModules();
   ZARK::APIPolling::JoinAll();
   HOST_LOG(LOG_INFO, "stopped");
   return served ? 0 : 1;

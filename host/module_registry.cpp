@@ -63,12 +63,16 @@ std::vector<MemoryRange> ModuleSegments(void *handle) {
 struct ModuleRegistry::LoadedModule {
   std::string path;
   std::vector<MethodRow> rows; // copies: nothing points into the module
+  ZARK_MODULE_START start = nullptr;
+  ZARK_MODULE_STOP stop = nullptr;
+  bool started = false;
   ModuleHandle handle;
 };
 
 ModuleRegistry::ModuleRegistry() = default;
 
 ModuleRegistry::~ModuleRegistry() {
+  StopModules();
   mApis.clear();
   // Unload in the reverse order of loading.
   while (!mModules.empty()) {
@@ -155,6 +159,14 @@ bool ModuleRegistry::LoadModule(const std::filesystem::path &file) {
     return reject("row " + std::to_string(i + 1) + ": " + row.api + " " +
                   row.method + " is served by " + owner->path + " already");
   }
+  module->start = reinterpret_cast<ZARK_MODULE_START>(
+      dlsym(handle.get(), ZARK_MODULE_START_SYMBOL));
+  module->stop = reinterpret_cast<ZARK_MODULE_STOP>(
+      dlsym(handle.get(), ZARK_MODULE_STOP_SYMBOL));
+  if ((module->start == nullptr) != (module->stop == nullptr)) {
+    return reject("exports only one of " ZARK_MODULE_START_SYMBOL
+                  " and " ZARK_MODULE_STOP_SYMBOL);
+  }
   module->handle = std::move(handle);
   for (const MethodRow &row : module->rows) {
     mApis[row.api][row.method][row.version] = {row.handler, module.get()};
@@ -163,6 +175,52 @@ bool ModuleRegistry::LoadModule(const std::filesystem::path &file) {
            module->rows.size());
   mModules.push_back(std::move(module));
   return true;
+}
+
+std::size_t ModuleRegistry::StartModules(const ZARK_MODULE_SETTINGS &settings) {
+  if (mStarted) {
+    return 0;
+  }
+  mStarted = true;
+  std::size_t started = 0;
+  for (const auto &module : mModules) {
+    if (module->start == nullptr) {
+      continue;
+    }
+    int code = -1;
+    try {
+      code = module->start(&settings);
+    } catch (...) {
+      HOST_LOG(LOG_ERR, "module %s start threw", module->path.c_str());
+    }
+    // Stop runs even after a failed start: it may have started a part.
+    module->started = true;
+    if (code != 0) {
+      HOST_LOG(LOG_ERR, "module %s start failed: %d", module->path.c_str(),
+               code);
+      continue;
+    }
+    HOST_LOG(LOG_INFO, "module %s started", module->path.c_str());
+    ++started;
+  }
+  return started;
+}
+
+void ModuleRegistry::StopModules() {
+  for (auto it = mModules.rbegin(); it != mModules.rend(); ++it) {
+    LoadedModule &module = **it;
+    if (!module.started) {
+      continue;
+    }
+    module.started = false;
+    try {
+      module.stop();
+    } catch (...) {
+      HOST_LOG(LOG_ERR, "module %s stop threw", module.path.c_str());
+      continue;
+    }
+    HOST_LOG(LOG_INFO, "module %s stopped", module.path.c_str());
+  }
 }
 
 ModuleRegistry::Lookup ModuleRegistry::Find(std::string_view api,

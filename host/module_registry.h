@@ -4,6 +4,7 @@
 #ifndef ZARK_HOST_MODULE_REGISTRY_H
 #define ZARK_HOST_MODULE_REGISTRY_H
 
+#include "module_lifecycle.h"
 #include "module_table.h"
 
 #include <json/json.h>
@@ -67,6 +68,15 @@ public:
 
   [[nodiscard]] std::size_t ModuleCount() const { return mModules.size(); }
 
+  // Calls the start function (module_lifecycle.h) of every loaded module
+  // that has one, in loading order, once; later calls do nothing. A start
+  // that fails is logged ("module <path> start failed: <code>"). Returns
+  // how many modules were started.
+  std::size_t StartModules(const ZARK_MODULE_SETTINGS &settings);
+  // Calls the stop function of every started module, in the reverse order,
+  // once. The destructor does it too, before unloading.
+  void StopModules();
+
 private:
   struct LoadedModule;
   struct Served {
@@ -77,6 +87,7 @@ private:
   using Methods = std::map<std::string, Versions, std::less<>>;
 
   std::vector<std::unique_ptr<LoadedModule>> mModules;
+  bool mStarted = false;
   std::map<std::string, Methods, std::less<>> mApis;
 };
 

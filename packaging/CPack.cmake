@@ -10,8 +10,9 @@
 #   <prefix>/<libdir>/zark/modules/ZARK.Core.PortForwarding.so
 #   <prefix>/share/zark/www/                    browser front end (www/dist)
 #   <prefix>/bin/zark-probed                    probe service
+#   <prefix>/<libdir>/zark/modules/ZARK.Core.PortForwarding.Status.so
+#                                               status module (the keeper)
 #   /usr/zark/bin/zarkportforward               tool the module runs
-#   /lib/systemd/system/zarkportforward-renew.{service,timer}
 #   /usr/zark/etc.defaults/services.d/*.sc      firewall service definitions
 #   /usr/zark/etc.defaults/firewall_service_mapping_table
 #   /etc.defaults/portforward/routerdb/         shipped router database
@@ -81,8 +82,9 @@ set(CPACK_PACKAGE_DESCRIPTION_SUMMARY
 set(CPACK_PACKAGE_DESCRIPTION
     "The port-forwarding module of the server's web administration service, \
 its web API host zark-webapid with the browser front end, the platform \
-libraries, the zarkportforward tool with its renew timer, the firewall \
-service definitions and the router database.")
+libraries, the status module whose keeper renews the router's mappings \
+inside the host, the zarkportforward tool, the firewall service \
+definitions and the router database.")
 # The package holds what `cmake --install` puts under the configured prefix
 # and the fixed absolute paths; both are staged as they are.
 set(CPACK_PACKAGING_INSTALL_PREFIX ${CMAKE_INSTALL_PREFIX})
@@ -101,6 +103,13 @@ libarchive13 (>= 3.6.2)")
 # Debug information stays in the build folder.
 set(CPACK_STRIP_FILES TRUE)
 set(CPACK_DEBIAN_PACKAGE_RECOMMENDS "systemd")
+# Maintainer scripts: the host (and so the keeper, the renewal service) is
+# enabled and started after install, stopped and disabled before removal.
+set(CPACK_DEBIAN_PACKAGE_CONTROL_EXTRA
+    ${CMAKE_CURRENT_LIST_DIR}/debian/postinst
+    ${CMAKE_CURRENT_LIST_DIR}/debian/prerm
+    ${CMAKE_CURRENT_LIST_DIR}/debian/postrm)
+set(CPACK_DEBIAN_PACKAGE_CONTROL_STRICT_PERMISSION TRUE)
 
 if(NOT CMAKE_INSTALL_PREFIX STREQUAL "/usr")
   message(STATUS "Debian package: CMAKE_INSTALL_PREFIX is "

@@ -55,10 +55,9 @@ expect "/usr/$libdir/zark/libzarkwebapi.so"
 expect "/usr/$libdir/zark/libzarkportmap.so"
 expect "/usr/$libdir/zark/libzarkfirewall.so"
 expect "/usr/$libdir/zark/modules/ZARK.Core.PortForwarding.so"
+expect "/usr/$libdir/zark/modules/ZARK.Core.PortForwarding.Status.so"
 expect "/usr/share/zark/www/index.html"
 expect "/usr/zark/bin/zarkportforward"
-expect "/lib/systemd/system/zarkportforward-renew.service"
-expect "/lib/systemd/system/zarkportforward-renew.timer"
 expect "/usr/zark/etc.defaults/firewall_service_mapping_table"
 expect "/usr/zark/etc.defaults/services.d/ssh.sc"
 expect "/etc.defaults/portforward/routerdb/routerdb.conf"
@@ -71,6 +70,7 @@ mkdir -p "$extract"
 dpkg-deb -x "$deb" "$extract"
 for elf in usr/sbin/zark-webapid usr/bin/zark-probed usr/zark/bin/zarkportforward \
   "usr/$libdir/zark/modules/ZARK.Core.PortForwarding.so" \
+  "usr/$libdir/zark/modules/ZARK.Core.PortForwarding.Status.so" \
   "usr/$libdir/zark/libzarkportmap.so"; do
   runpath=$(objdump -p "$extract/$elf" | awk '$1 == "RUNPATH" || $1 == "RPATH" { print $2 }')
   if [ "$runpath" != "/usr/$libdir/zark" ]; then
@@ -97,6 +97,30 @@ for ((i = 1; i + 1 < ${#exec_start[@]}; i++)); do
   --accounts) unit_check "--accounts folder" "$(dirname "${exec_start[i + 1]}")" ;;
   esac
 done
+
+# Renewal is on after install: the maintainer scripts enable and start the
+# host, whose status module runs the keeper; no second renewer (a timer).
+control="$out/control"
+mkdir -p "$control"
+dpkg-deb -e "$deb" "$control"
+for script in postinst prerm postrm; do
+  if ! [ -x "$control/$script" ]; then
+    echo "check-deb: the package has no executable $script" >&2
+    failures=$((failures + 1))
+  fi
+done
+if ! grep -q 'systemctl enable zark-webapid.service' "$control/postinst" 2>/dev/null; then
+  echo "check-deb: postinst does not enable zark-webapid.service" >&2
+  failures=$((failures + 1))
+fi
+if ! grep -q 'disable --now zark-webapid.service' "$control/prerm" 2>/dev/null; then
+  echo "check-deb: prerm does not stop zark-webapid.service" >&2
+  failures=$((failures + 1))
+fi
+if grep -q 'zarkportforward-renew' <<<"$listing"; then
+  echo "check-deb: the package still ships a renewal timer besides the keeper" >&2
+  failures=$((failures + 1))
+fi
 
 depends=$(dpkg-deb -f "$deb" Depends)
 for package in libjsoncpp25 libminiupnpc17 libnatpmp1 libcpp-httplib0.11 libcrypt1 \

@@ -76,6 +76,10 @@ stage() {
   if [ -z "$bin" ] || [ -z "$module" ] || [ -z "$www" ]; then
     die "the installation lacks the host, the module or the front end (see $manifest)"
   fi
+  # The status module runs the keeper (lease renewal, lost mappings
+  # restored): without it nothing renews the router's mappings.
+  grep -q '/ZARK\.Core\.PortForwarding\.Status\.so$' "$manifest" ||
+    die "the installation lacks the status module ZARK.Core.PortForwarding.Status.so (the renewal service; see $manifest)"
   local path
   for path in "$bin" "$module" "$www"; do
     case "$path" in
@@ -210,8 +214,14 @@ host)
   bin=$(sed -n 's/^bin=//p' "$state/host.conf")
   modules=$(sed -n 's/^modules=//p' "$state/host.conf")
   www=$(sed -n 's/^www=//p' "$state/host.conf")
+  # ZARK_KEEPER_INTERVAL: how often the keeper checks the router for lost
+  # mappings (seconds; the host's default is 300).
+  keeper=()
+  if [ -n "${ZARK_KEEPER_INTERVAL:-}" ]; then
+    keeper=(--keeper-interval "$ZARK_KEEPER_INTERVAL")
+  fi
   exec bash "$(realpath "$0")" exec "$state" "$bin" --modules "$modules" \
-    --www "$www" --accounts /etc/zark/webapid.accounts "$@"
+    --www "$www" --accounts /etc/zark/webapid.accounts "${keeper[@]}" "$@"
   ;;
 __enter)
   enter "$@"

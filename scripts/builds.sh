@@ -64,7 +64,7 @@ build_installed() {
   configure_plain "$1"
   cmake --build "$1" -j "$jobs" --target \
     zark_klibc zark_webapi zark_portmap zark_firewall zark_module \
-    zarkportforward zark-webapid zark_probed
+    zark_status_module zarkportforward zark-webapid zark_probed
 }
 
 # Runs scripts/install-deps.sh with the given options once for the whole

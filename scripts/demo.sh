@@ -11,8 +11,8 @@
 #
 # The page is relayed to the machine's 127.0.0.1:5000 (--listen or
 # ZARK_LISTEN to change). ZARK_STATE_DIR (default ./state-demo) and
-# ZARK_BUILD_DIR (default ./build) as for scripts/run.sh. Ctrl-C stops the
-# host and removes the network.
+# ZARK_BUILD_DIR (default ./build) and ZARK_KEEPER_INTERVAL (default 300 s)
+# as for scripts/run.sh. Ctrl-C stops the host and removes the network.
 set -euo pipefail
 
 root=$(cd "$(dirname "$0")/.." && pwd)
@@ -78,6 +78,8 @@ The demo runs. Open
   password:  $(cat "$password_file" 2>/dev/null || echo "see $tn_state/etc/zark")
   state:     $tn_state
   logs:      $tn_logs (syslog.log: the host's syslog lines)
+  renewal:   the keeper in zark-webapid checks the router every ${ZARK_KEEPER_INTERVAL:-300} s
+             and restores the mappings it lost (ZARK_KEEPER_INTERVAL)
 
   server     $(tn_server_ns): 192.168.77.2, zark-webapid on its 127.0.0.1:5000
   router     $name-r: miniupnpd, UPnP IGD $TN_ROOT_DESC and NAT-PMP

@@ -10,6 +10,8 @@
 #                    --listen wins)
 #   ZARK_STATE_DIR   the state folder (default ./state of the repository)
 #   ZARK_BUILD_DIR   the build folder (default ./build of the repository)
+#   ZARK_KEEPER_INTERVAL  how often the host's keeper checks the router for
+#                    lost mappings, in seconds (default 300)
 #
 # Nothing is installed on the machine: the build is installed into the state
 # folder, and the host runs in a private mount namespace in which that
@@ -69,6 +71,8 @@ cat <<EOF
 EOF
 cat <<EOF
   logs:      $state/logs/syslog.log (the host's syslog lines)
+  renewal:   the keeper in zark-webapid renews leases at half their time and
+             checks the router every ${ZARK_KEEPER_INTERVAL:-300} s (ZARK_KEEPER_INTERVAL)
 EOF
 echo
 echo "Ctrl-C stops it."

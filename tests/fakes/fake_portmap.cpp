@@ -2,6 +2,7 @@
 
 #include <arpa/inet.h>
 
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <mutex>
@@ -17,7 +18,9 @@ void Record(const std::string &name, std::vector<std::string> args = {}) {
   gCalls.push_back({name, std::move(args)});
 }
 
-std::string Text(const char *text) { return text ? text : "(null)"; }
+std::string Text(const char *text) {
+  return text ? text : "(null)";
+}
 
 void CopyText(char *field, const std::string &text) {
   std::strncpy(field, text.c_str(), ZARK_PORTMAP_TEXT_SIZE - 1);
@@ -47,11 +50,11 @@ PortMap MakeDefaults() {
                                         ZARK_LIBZARKPORTMAP_ERR *) {
     return HandOutRules(Fake().savedRules, count, rules);
   };
-  fake.KLibGetRulesArrFromTestRuleConf =
-      [](int *count, ZARK_ROUTER_RULE **rules, char *, bool,
-         ZARK_LIBZARKPORTMAP_ERR *) {
-        return HandOutRules(Fake().testRules, count, rules);
-      };
+  fake.KLibGetRulesArrFromTestRuleConf = [](int *count,
+                                            ZARK_ROUTER_RULE **rules, char *,
+                                            bool, ZARK_LIBZARKPORTMAP_ERR *) {
+    return HandOutRules(Fake().testRules, count, rules);
+  };
   fake.KLibSaveRules = [](const char *, int count, ZARK_ROUTER_RULE *rules,
                           bool, ZARK_ROUTER_SAVE_RULE_RESULT *,
                           ZARK_SAVE_RULE_PROGRESS_CB, void *) {
@@ -122,12 +125,55 @@ PortMap MakeDefaults() {
   fake.KLibTestUpnpCompatibility =
       [](int, ZARK_ROUTER_TEST_COMPATIBILITY_RESULT *,
          ZARK_TEST_COMPATIBILITY_PROGRESS_CB, void *, bool) { return 0; };
-  fake.KLibWriteRecordIntoUpnpDB = [](const ZARK_ROUTER_RECORD *) {
-    return 0;
-  };
+  fake.KLibWriteRecordIntoUpnpDB = [](const ZARK_ROUTER_RECORD *) { return 0; };
   fake.KLibStopTestUpnpCompatibility = [] { return 0; };
   fake.KLibUploadTestUpnpCompatibilityFailResult = [] { return 0; };
   fake.ZARKIGetExternalIP = [] { return htonl(0xCB007107u); }; // 203.0.113.7
+  fake.portMapStatus =
+      R"({"gateway": "192.168.1.1", "protocol": "upnp", )"
+      R"("external_address": "203.0.113.7", "last_job": null, "rules": []})";
+  fake.KLibListRouterMappings = [](const char *, ZARK_ROUTER_MAPPINGS *out,
+                                   ZARK_LIBZARKPORTMAP_ERR *) {
+    const std::vector<ZARK_ROUTER_MAPPING> &source = Fake().routerMappings;
+    std::strcpy(out->router_protocol, "upnp");
+    std::strcpy(out->location, "http://192.168.1.1:5000/rootDesc.xml");
+    out->count = static_cast<int32_t>(source.size());
+    if (!source.empty()) {
+      out->mappings = static_cast<ZARK_ROUTER_MAPPING *>(
+          std::calloc(source.size(), sizeof(ZARK_ROUTER_MAPPING)));
+      std::memcpy(out->mappings, source.data(),
+                  source.size() * sizeof(ZARK_ROUTER_MAPPING));
+    }
+    return 0;
+  };
+  fake.KLibGetPortMapStatus = [](const char *, char **json,
+                                 ZARK_LIBZARKPORTMAP_ERR *) {
+    *json = strdup(Fake().portMapStatus.c_str());
+    return 0;
+  };
+  fake.KLibRepairSavedRules =
+      [](const char *, ZARK_PORTMAP_APPLY_SUMMARY *summary,
+         ZARK_ROUTER_SAVE_RULE_RESULT *result,
+         ZARK_SAVE_RULE_PROGRESS_CB callback, void *arg) {
+        for (int percentage : {50, 100}) {
+          result->percentage = percentage;
+          if (callback != nullptr) {
+            callback(result, arg);
+          }
+        }
+        summary->added = Fake().repairRestored;
+        summary->repaired = Fake().repairRestored;
+        return 0;
+      };
+  fake.KLibKeepRouter = [](const char *, int interval, int *nextSeconds,
+                           ZARK_PORTMAP_APPLY_SUMMARY *,
+                           ZARK_ROUTER_SAVE_RULE_RESULT *) {
+    *nextSeconds = interval;
+    return 0;
+  };
+  fake.KLibDeleteOurMapping = [](const char *, const char *, uint16_t, char *,
+                                 size_t,
+                                 ZARK_LIBZARKPORTMAP_ERR *) { return 0; };
   return fake;
 }
 
@@ -165,12 +211,10 @@ size_t CountCalls(const std::string &name) {
   return n;
 }
 
-ZARK_ROUTER_RULE MakeRule(const std::string &ruleId, bool enable,
-                          const std::string &protocol,
-                          const std::string &routerPort,
-                          const std::string &dsPort,
-                          const std::string &serviceId,
-                          const std::string &serviceName) {
+ZARK_ROUTER_RULE
+MakeRule(const std::string &ruleId, bool enable, const std::string &protocol,
+         const std::string &routerPort, const std::string &dsPort,
+         const std::string &serviceId, const std::string &serviceName) {
   ZARK_ROUTER_RULE rule{};
   CopyText(rule.rule_id, ruleId);
   rule.enable = enable ? 1 : 0;
@@ -180,6 +224,27 @@ ZARK_ROUTER_RULE MakeRule(const std::string &ruleId, bool enable,
   CopyText(rule.serviceid, serviceId);
   CopyText(rule.service_name, serviceName);
   return rule;
+}
+
+ZARK_ROUTER_MAPPING
+MakeMapping(const std::string &protocol, uint16_t externalPort,
+            const std::string &internalClient, uint16_t internalPort,
+            const std::string &description, uint32_t leaseSeconds, bool ours,
+            const std::string &ruleId) {
+  ZARK_ROUTER_MAPPING mapping{};
+  std::snprintf(mapping.protocol, sizeof(mapping.protocol), "%s",
+                protocol.c_str());
+  mapping.external_port = externalPort;
+  mapping.internal_port = internalPort;
+  std::snprintf(mapping.internal_client, sizeof(mapping.internal_client), "%s",
+                internalClient.c_str());
+  mapping.lease_seconds = leaseSeconds;
+  mapping.ours = ours ? 1 : 0;
+  mapping.held = ours ? 1 : 0;
+  mapping.enabled = 1;
+  CopyText(mapping.description, description);
+  CopyText(mapping.rule_id, ruleId);
+  return mapping;
 }
 
 ZARK_ROUTERDB_LIST MakeRouterDBNode(const std::string &brand,
@@ -340,6 +405,76 @@ int KLibUploadTestUpnpCompatibilityFailResult(void) {
 uint32_t ZARKIGetExternalIP(void) {
   Record("ZARKIGetExternalIP");
   return Fake().ZARKIGetExternalIP();
+}
+
+int KLibListRouterMappings(const char *gatewayIP,
+                           ZARK_ROUTER_MAPPINGS *mappings,
+                           ZARK_LIBZARKPORTMAP_ERR *err) {
+  Record("KLibListRouterMappings", {Text(gatewayIP)});
+  *mappings = ZARK_ROUTER_MAPPINGS{};
+  return Fake().KLibListRouterMappings(gatewayIP, mappings, err);
+}
+
+void KLibFreeRouterMappings(ZARK_ROUTER_MAPPINGS *mappings) {
+  Record("KLibFreeRouterMappings");
+  if (mappings != nullptr) {
+    std::free(mappings->mappings);
+    mappings->mappings = nullptr;
+    mappings->count = 0;
+  }
+}
+
+const char *KLibFailureKindName(ZARK_FAILURE_KIND kind) {
+  static const char *const kNames[] = {"",
+                                       "router_not_answering",
+                                       "conflict",
+                                       "port_refused",
+                                       "table_full",
+                                       "double_nat",
+                                       "lease_refused",
+                                       "not_configured",
+                                       "local",
+                                       "other"};
+  const int index = static_cast<int>(kind);
+  return index >= 0 && index < 10 ? kNames[index] : "";
+}
+
+int KLibGetPortMapStatus(const char *gatewayIP, char **json,
+                         ZARK_LIBZARKPORTMAP_ERR *err) {
+  Record("KLibGetPortMapStatus", {Text(gatewayIP)});
+  *json = nullptr;
+  return Fake().KLibGetPortMapStatus(gatewayIP, json, err);
+}
+
+void KLibFreeText(char *text) {
+  Record("KLibFreeText", {text ? "text" : "(null)"});
+  std::free(text);
+}
+
+int KLibRepairSavedRules(const char *gatewayIP,
+                         ZARK_PORTMAP_APPLY_SUMMARY *summary,
+                         ZARK_ROUTER_SAVE_RULE_RESULT *result,
+                         ZARK_SAVE_RULE_PROGRESS_CB callback, void *arg) {
+  Record("KLibRepairSavedRules", {Text(gatewayIP)});
+  return Fake().KLibRepairSavedRules(gatewayIP, summary, result, callback, arg);
+}
+
+int KLibKeepRouter(const char *gatewayIP, int checkIntervalSeconds,
+                   int *nextSeconds, ZARK_PORTMAP_APPLY_SUMMARY *summary,
+                   ZARK_ROUTER_SAVE_RULE_RESULT *result) {
+  Record("KLibKeepRouter",
+         {Text(gatewayIP), std::to_string(checkIntervalSeconds)});
+  return Fake().KLibKeepRouter(gatewayIP, checkIntervalSeconds, nextSeconds,
+                               summary, result);
+}
+
+int KLibDeleteOurMapping(const char *gatewayIP, const char *protocol,
+                         uint16_t externalPort, char *message,
+                         size_t messageSize, ZARK_LIBZARKPORTMAP_ERR *err) {
+  Record("KLibDeleteOurMapping",
+         {Text(gatewayIP), Text(protocol), std::to_string(externalPort)});
+  return Fake().KLibDeleteOurMapping(gatewayIP, protocol, externalPort, message,
+                                     messageSize, err);
 }
 
 } // extern "C"

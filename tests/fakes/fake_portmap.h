@@ -6,14 +6,19 @@
 //   "192.168.1.1"; router database from routerDB; router configuration
 //   from routerConf (KLibSetRouterConf appends to storedConfs); detection
 //   calls the callback at 10, 20, 30, 40, 70, 50, 80, 100 with detectResult
-//   and returns 0; running task 0; external address 203.0.113.7; every
-//   other call 0.
+//   and returns 0; running task 0; external address 203.0.113.7; the
+//   router's table from routerMappings; the port-map status is the text
+//   portMapStatus; a repair calls the callback at 50 and 100 and counts
+//   repairRestored as added and repaired; a keeper round sets nextSeconds to
+//   the check interval; failure kind names are the library's; every other call
+//   0.
 // The rule store classes (RouterRuleConfWriter/Reader) are the real ones.
 #ifndef ZARK_TESTS_FAKE_PORTMAP_H
 #define ZARK_TESTS_FAKE_PORTMAP_H
 
 #include "libzarkportmap.h"
 #include "zarknet.h"
+#include "zarkportforward.h"
 
 #include <functional>
 #include <string>
@@ -35,6 +40,9 @@ struct PortMap {
   std::vector<ZARK_ROUTER_CONF> storedConfs;
   ZARK_ROUTER_DETECT_RESULT detectResult{};
   std::vector<ZARK_ROUTER_RULE> lastSavedRules; // rules given to KLibSaveRules
+  std::vector<ZARK_ROUTER_MAPPING> routerMappings;
+  std::string portMapStatus;
+  int32_t repairRestored = 0;
 
   std::function<int()> KLibZarkPortMapLock;
   std::function<int()> KLibZarkPortMapUnLock;
@@ -76,6 +84,21 @@ struct PortMap {
   std::function<int()> KLibStopTestUpnpCompatibility;
   std::function<int()> KLibUploadTestUpnpCompatibilityFailResult;
   std::function<uint32_t()> ZARKIGetExternalIP;
+  std::function<int(const char *, ZARK_ROUTER_MAPPINGS *,
+                    ZARK_LIBZARKPORTMAP_ERR *)>
+      KLibListRouterMappings;
+  std::function<int(const char *, char **, ZARK_LIBZARKPORTMAP_ERR *)>
+      KLibGetPortMapStatus;
+  std::function<int(const char *, ZARK_PORTMAP_APPLY_SUMMARY *,
+                    ZARK_ROUTER_SAVE_RULE_RESULT *, ZARK_SAVE_RULE_PROGRESS_CB,
+                    void *)>
+      KLibRepairSavedRules;
+  std::function<int(const char *, int, int *, ZARK_PORTMAP_APPLY_SUMMARY *,
+                    ZARK_ROUTER_SAVE_RULE_RESULT *)>
+      KLibKeepRouter;
+  std::function<int(const char *, const char *, uint16_t, char *, size_t,
+                    ZARK_LIBZARKPORTMAP_ERR *)>
+      KLibDeleteOurMapping;
 };
 
 // The process's one fake. Replace members before the code under test runs.
@@ -96,6 +119,13 @@ ZARK_ROUTER_RULE MakeRule(const std::string &ruleId, bool enable,
                           const std::string &dsPort,
                           const std::string &serviceId = "",
                           const std::string &serviceName = "");
+
+// Builds a mapping of the router's table (texts cut to fit).
+ZARK_ROUTER_MAPPING
+MakeMapping(const std::string &protocol, uint16_t externalPort,
+            const std::string &internalClient, uint16_t internalPort,
+            const std::string &description, uint32_t leaseSeconds, bool ours,
+            const std::string &ruleId = "");
 
 // Builds a router database node.
 ZARK_ROUTERDB_LIST MakeRouterDBNode(const std::string &brand,

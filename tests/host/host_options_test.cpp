@@ -33,13 +33,15 @@ TEST(HostOptions, DefaultsListenOnLoopbackPort5000) {
   EXPECT_EQ(parsed.options.sessions.idleTimeout, 30min);
   EXPECT_EQ(parsed.options.sessions.maxLifetime, 12h);
   EXPECT_FALSE(parsed.options.secureCookie);
+  EXPECT_EQ(parsed.options.modules.keeper_interval_seconds, 300);
+  EXPECT_EQ(parsed.options.modules.size, sizeof(ZARK_MODULE_SETTINGS));
 }
 
 TEST(HostOptions, EveryOptionTakesItsValue) {
-  Parsed parsed =
-      Parse({"--listen", "[::1]:8080", "--modules=/m", "--accounts", "/a",
-             "--www", "/w", "--threads", "3", "--session-idle", "60",
-             "--session-max=3600", "--secure-cookie"});
+  Parsed parsed = Parse({"--listen", "[::1]:8080", "--modules=/m", "--accounts",
+                         "/a", "--www", "/w", "--threads", "3",
+                         "--session-idle", "60", "--session-max=3600",
+                         "--secure-cookie", "--keeper-interval", "5"});
   ASSERT_EQ(parsed.result, OptionsResult::Run) << parsed.error;
   EXPECT_EQ(parsed.options.http.address, "::1");
   EXPECT_EQ(parsed.options.http.port, 8080);
@@ -50,6 +52,7 @@ TEST(HostOptions, EveryOptionTakesItsValue) {
   EXPECT_EQ(parsed.options.sessions.idleTimeout, 60s);
   EXPECT_EQ(parsed.options.sessions.maxLifetime, 1h);
   EXPECT_TRUE(parsed.options.secureCookie);
+  EXPECT_EQ(parsed.options.modules.keeper_interval_seconds, 5);
 }
 
 TEST(HostOptions, BadValuesAreErrors) {
@@ -63,6 +66,9 @@ TEST(HostOptions, BadValuesAreErrors) {
         {"--threads", "many"},
         {"--session-idle", "0"},
         {"--session-idle"},
+        {"--keeper-interval", "0"},
+        {"--keeper-interval", "86401"},
+        {"--keeper-interval", "5m"},
         {"--bogus"},
         {"-x"},
         {"stray"}}) {

@@ -4,9 +4,6 @@
 #include "host_test_support.h"
 
 #include <httplib.h>
-#include <netinet/in.h>
-#include <spawn.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -17,73 +14,17 @@
 #include <csignal>
 #include <thread>
 
-extern char **environ;
-
 namespace zark::host {
 namespace {
 
 using namespace std::chrono_literals;
 
-// A port on 127.0.0.1 that was free a moment ago.
-int FreePort() {
-  int fd = socket(AF_INET, SOCK_STREAM, 0);
-  sockaddr_in address{};
-  address.sin_family = AF_INET;
-  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t length = sizeof(address);
-  int port = -1;
-  if (fd >= 0 &&
-      bind(fd, reinterpret_cast<sockaddr *>(&address), sizeof(address)) == 0 &&
-      getsockname(fd, reinterpret_cast<sockaddr *>(&address), &length) == 0) {
-    port = ntohs(address.sin_port);
-  }
-  if (fd >= 0) {
-    close(fd);
-  }
-  return port;
-}
+using test::FreePort;
+using test::WaitFor;
 
 // Starts the executable with args; stdinFd (if not -1) becomes its input.
 pid_t Spawn(const std::vector<std::string> &args, int stdinFd = -1) {
-  std::vector<std::string> all = {HOST_WEBAPID};
-  all.insert(all.end(), args.begin(), args.end());
-  std::vector<char *> argv;
-  for (std::string &arg : all) {
-    argv.push_back(arg.data());
-  }
-  argv.push_back(nullptr);
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  if (stdinFd >= 0) {
-    posix_spawn_file_actions_adddup2(&actions, stdinFd, STDIN_FILENO);
-  }
-  pid_t pid = -1;
-  int error =
-      posix_spawn(&pid, argv[0], &actions, nullptr, argv.data(), environ);
-  posix_spawn_file_actions_destroy(&actions);
-  EXPECT_EQ(error, 0) << "posix_spawn " << HOST_WEBAPID;
-  return error == 0 ? pid : -1;
-}
-
-// Waits (bounded) for the process to end; kills it when it does not.
-// Returns its wait status, or -1 when it had to be killed.
-int WaitFor(pid_t pid, std::chrono::seconds limit) {
-  const auto deadline = std::chrono::steady_clock::now() + limit;
-  while (std::chrono::steady_clock::now() < deadline) {
-    int status = 0;
-    pid_t done = waitpid(pid, &status, WNOHANG);
-    if (done == pid) {
-      return status;
-    }
-    if (done < 0) {
-      return -1;
-    }
-    std::this_thread::sleep_for(20ms);
-  }
-  kill(pid, SIGKILL);
-  int status = 0;
-  waitpid(pid, &status, 0);
-  return -1;
+  return test::SpawnProgram(HOST_WEBAPID, args, stdinFd);
 }
 
 class HostProcess : public ::testing::TestWithParam<int> {
@@ -108,17 +49,7 @@ TEST_P(HostProcess, StopSignalEndsTheHostWithStatusZero) {
   httplib::Client client("127.0.0.1", port);
   client.set_connection_timeout(1s);
   client.set_read_timeout(10s);
-  bool up = false;
-  for (int attempt = 0; attempt < 300 && !up; ++attempt) {
-    httplib::Result page = client.Get("/");
-    up = page && page->status == 200;
-    if (!up) {
-      std::this_thread::sleep_for(50ms);
-    }
-  }
-  if (!up) {
-    kill(pid, SIGKILL);
-    WaitFor(pid, 10s);
+  if (!test::WaitUntilServing(pid, port)) {
     FAIL() << "the host did not answer on port " << port;
   }
 

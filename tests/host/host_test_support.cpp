@@ -5,9 +5,19 @@
 #include "webapi.h"
 
 #include <crypt.h>
+#include <httplib.h>
+#include <netinet/in.h>
+#include <signal.h>
+#include <spawn.h>
+#include <sys/socket.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <cstdio>
 #include <memory>
+#include <thread>
+
+extern char **environ;
 
 namespace zark::host::test {
 
@@ -174,6 +184,81 @@ std::string FormEncode(const std::string &text) {
     }
   }
   return out;
+}
+
+int FreePort() {
+  int fd = socket(AF_INET, SOCK_STREAM, 0);
+  sockaddr_in address{};
+  address.sin_family = AF_INET;
+  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  socklen_t length = sizeof(address);
+  int port = -1;
+  if (fd >= 0 &&
+      bind(fd, reinterpret_cast<sockaddr *>(&address), sizeof(address)) == 0 &&
+      getsockname(fd, reinterpret_cast<sockaddr *>(&address), &length) == 0) {
+    port = ntohs(address.sin_port);
+  }
+  if (fd >= 0) {
+    close(fd);
+  }
+  return port;
+}
+
+pid_t SpawnProgram(const std::string &program,
+                   const std::vector<std::string> &args, int stdinFd) {
+  std::vector<std::string> all = {program};
+  all.insert(all.end(), args.begin(), args.end());
+  std::vector<char *> argv;
+  for (std::string &arg : all) {
+    argv.push_back(arg.data());
+  }
+  argv.push_back(nullptr);
+  posix_spawn_file_actions_t actions;
+  posix_spawn_file_actions_init(&actions);
+  if (stdinFd >= 0) {
+    posix_spawn_file_actions_adddup2(&actions, stdinFd, STDIN_FILENO);
+  }
+  pid_t pid = -1;
+  int error =
+      posix_spawn(&pid, argv[0], &actions, nullptr, argv.data(), environ);
+  posix_spawn_file_actions_destroy(&actions);
+  EXPECT_EQ(error, 0) << "posix_spawn " << program;
+  return error == 0 ? pid : -1;
+}
+
+int WaitFor(pid_t pid, std::chrono::seconds limit) {
+  const auto deadline = std::chrono::steady_clock::now() + limit;
+  while (std::chrono::steady_clock::now() < deadline) {
+    int status = 0;
+    pid_t done = waitpid(pid, &status, WNOHANG);
+    if (done == pid) {
+      return status;
+    }
+    if (done < 0) {
+      return -1;
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  }
+  kill(pid, SIGKILL);
+  int status = 0;
+  waitpid(pid, &status, 0);
+  return -1;
+}
+
+bool WaitUntilServing(pid_t pid, int port) {
+  httplib::Client client("127.0.0.1", port);
+  client.set_connection_timeout(std::chrono::seconds(1));
+  client.set_read_timeout(std::chrono::seconds(10));
+  for (int attempt = 0; attempt < 300; ++attempt) {
+    httplib::Result page = client.Get("/");
+    if (page && page->status == 200) {
+      return true;
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+  }
+  kill(pid, SIGKILL);
+  WaitFor(pid, std::chrono::seconds(10));
+  return false;
 }
 
 std::string CookieId(const std::string &setCookie) {

@@ -12,6 +12,9 @@
 #include "session_store.h"
 
 #include <gtest/gtest.h>
+#include <sys/types.h>
+
+#include <chrono>
 
 #include <filesystem>
 #include <initializer_list>
@@ -94,6 +97,23 @@ bool HasLogFrom(int priority, const std::string &sourceFile,
 
 // URL-encodes text for a form.
 std::string FormEncode(const std::string &text);
+
+// A port on 127.0.0.1 that was free a moment ago, or -1.
+int FreePort();
+
+// Starts program with args (program's name is argv[0]); stdinFd (if not -1)
+// becomes its input. The child's id, or -1 (a test failure) when it could
+// not be started.
+pid_t SpawnProgram(const std::string &program,
+                   const std::vector<std::string> &args, int stdinFd = -1);
+
+// Waits (bounded) for the process to end; kills it when it does not.
+// Returns its wait status, or -1 when it had to be killed.
+int WaitFor(pid_t pid, std::chrono::seconds limit);
+
+// Waits (bounded: 15 s) until the host process pid answers "/" on
+// 127.0.0.1:port. When it does not, kills it and returns false.
+bool WaitUntilServing(pid_t pid, int port);
 
 // The session id in a Set-Cookie value ("id=...; Path=/; ..."), or empty.
 std::string CookieId(const std::string &setCookie);

@@ -100,7 +100,9 @@ struct Malformed {
   const char *reason;
 };
 
-void PrintTo(const Malformed &c, std::ostream *out) { *out << c.module; }
+void PrintTo(const Malformed &c, std::ostream *out) {
+  *out << c.module;
+}
 
 class HostLoaderMalformed : public HostLoader,
                             public ::testing::WithParamInterface<Malformed> {};
@@ -219,6 +221,85 @@ TEST_F(HostLoader, PortForwardingModuleLoadsWithItsTwentyMethods) {
             ModuleRegistry::Lookup::Found);
   EXPECT_EQ(Find(modules, "ZARK.Core.PortForwarding.Compatibility", "stop", 1),
             ModuleRegistry::Lookup::Found);
+}
+
+// What the lifecycle module noted so far.
+std::string LifecycleLog() {
+  return fs::exists("/tmp/host/lifecycle.log")
+             ? zark::test::ReadFile("/tmp/host/lifecycle.log")
+             : std::string();
+}
+
+ZARK_MODULE_SETTINGS Settings(int interval) {
+  ZARK_MODULE_SETTINGS settings = DefaultModuleSettings();
+  settings.keeper_interval_seconds = interval;
+  return settings;
+}
+
+TEST_F(HostLoader, StartAndStopRunOnceEach) {
+  fs::create_directories("/tmp/host");
+  ModuleRegistry modules;
+  ASSERT_EQ(modules.LoadFolder(
+                ModuleFolder("lifecycle", {"good_module", "lifecycle_module"})),
+            2u);
+  // Loading alone starts nothing.
+  EXPECT_EQ(LifecycleLog(), "");
+  EXPECT_EQ(modules.StartModules(Settings(7)), 1u);
+  EXPECT_EQ(modules.StartModules(Settings(7)), 0u);
+  EXPECT_EQ(LifecycleLog(), "start 7\n");
+  modules.StopModules();
+  modules.StopModules();
+  EXPECT_EQ(LifecycleLog(), "start 7\nstop\n");
+}
+
+TEST_F(HostLoader, UnloadingStopsAStartedModule) {
+  fs::create_directories("/tmp/host");
+  {
+    ModuleRegistry modules;
+    ASSERT_EQ(modules.LoadFolder(
+                  ModuleFolder("lifecycle-unload", {"lifecycle_module"})),
+              1u);
+    modules.StartModules(Settings(300));
+  }
+  EXPECT_EQ(LifecycleLog(), "start 300\nstop\n");
+}
+
+TEST_F(HostLoader, UnloadingANeverStartedModuleStopsNothing) {
+  fs::create_directories("/tmp/host");
+  {
+    ModuleRegistry modules;
+    ASSERT_EQ(modules.LoadFolder(
+                  ModuleFolder("lifecycle-idle", {"lifecycle_module"})),
+              1u);
+  }
+  EXPECT_EQ(LifecycleLog(), "");
+}
+
+TEST_F(HostLoader, FailedStartIsLoggedAndStillStopped) {
+  fs::create_directories("/tmp/host");
+  fs::path folder = ModuleFolder("lifecycle-fail", {"lifecycle_module"});
+  ModuleRegistry modules;
+  ASSERT_EQ(modules.LoadFolder(folder), 1u);
+  EXPECT_EQ(modules.StartModules(Settings(13)), 0u);
+  EXPECT_TRUE(test::HasLogFrom(LOG_ERR, "host/module_registry.cpp",
+                               "module " +
+                                   (folder / "lifecycle_module.so").string() +
+                                   " start failed: -13"));
+  // Still served.
+  EXPECT_EQ(Find(modules, "Test.Lifecycle", "ping", 1),
+            ModuleRegistry::Lookup::Found);
+  modules.StopModules();
+  EXPECT_EQ(LifecycleLog(), "start 13\nstop\n");
+}
+
+TEST_F(HostLoader, StartWithoutStopIsRejected) {
+  fs::path folder = ModuleFolder("half", {"half_lifecycle_module"});
+  ModuleRegistry modules;
+  EXPECT_EQ(modules.LoadFolder(folder), 0u);
+  EXPECT_TRUE(Rejected(folder / "half_lifecycle_module.so",
+                       "exports only one of ZarkModuleStart and "
+                       "ZarkModuleStop"));
+  EXPECT_FALSE(IsLoaded(folder / "half_lifecycle_module.so"));
 }
 
 } // namespace
