@@ -1,6 +1,7 @@
 #include "http_server.h"
 
 #include "host_log.h"
+#include "request_guard.h"
 
 #include <httplib.h>
 #include <sys/socket.h>
@@ -213,6 +214,55 @@ void AnswerException(const httplib::Request &request,
   SendJson(response, 500, ErrorAnswer(ZARK::WEBAPI_ERR_UNKNOWN));
 }
 
+// A refusal of the request guard: JSON under /webapi/, plain text elsewhere.
+httplib::Server::HandlerResponse Refuse(const httplib::Request &request,
+                                        httplib::Response &response, int status,
+                                        int code, const char *reason) {
+  // The body, if any, is left unread: the connection ends with the answer.
+  response.set_header("Connection", "close");
+  if (IsApiPath(request.path)) {
+    Json::Value errors(Json::objectValue);
+    errors["reason"] = reason;
+    SendJson(response, status, ErrorAnswer(code, errors));
+  } else {
+    response.status = status;
+    response.set_content(std::string(reason) + " refused\n", "text/plain");
+  }
+  return httplib::Server::HandlerResponse::Handled;
+}
+
+// Every request, before it is routed (and before its body is read): control
+// characters in the path, a Host that is not this machine, an Origin of
+// another site.
+void GuardRequests(httplib::Server &server, std::vector<std::string> names) {
+  server.set_pre_routing_handler(
+      [names = std::move(names)](const httplib::Request &request,
+                                 httplib::Response &response) {
+        if (HasControlCharacter(request.path)) {
+          return Refuse(request, response, 400, ZARK::WEBAPI_ERR_BAD_REQUEST,
+                        "path");
+        }
+        const std::string host = request.get_header_value("Host");
+        if (request.get_header_value_count("Host") > 1 ||
+            !IsAllowedHost(host, names)) {
+          HOST_LOG(LOG_NOTICE, "request from %s refused: not this host",
+                   request.remote_addr.c_str());
+          return Refuse(request, response, 421, ZARK::WEBAPI_ERR_NOT_ALLOWED,
+                        "host");
+        }
+        // Browsers send Origin with every POST and every cross-site call;
+        // a client that sends none is not a browser page of another site.
+        if (request.has_header("Origin") &&
+            !IsSameOrigin(request.get_header_value("Origin"), host)) {
+          HOST_LOG(LOG_NOTICE, "request from %s refused: another site's page",
+                   request.remote_addr.c_str());
+          return Refuse(request, response, 403, ZARK::WEBAPI_ERR_NOT_ALLOWED,
+                        "origin");
+        }
+        return httplib::Server::HandlerResponse::Unhandled;
+      });
+}
+
 // The front end from the www folder, or the built-in page when it cannot
 // be served.
 void RouteFrontEnd(httplib::Server &server,
@@ -257,6 +307,8 @@ HttpServer::~HttpServer() {
 void HttpServer::Route() {
   httplib::Server &server = *mServer;
   ApplyLimits(server, mOptions);
+  GuardRequests(server, mOptions.hostNames.empty() ? LocalHostNames()
+                                                   : mOptions.hostNames);
   RouteApi(server, mHandler, mOptions.maxBodyBytes);
   // Failures the library answers itself (bounds, unknown paths under
   // /webapi/) get a JSON body there too.

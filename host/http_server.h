@@ -12,6 +12,7 @@
 #include <filesystem>
 #include <memory>
 #include <string>
+#include <vector>
 
 namespace httplib {
 class Server;
@@ -31,6 +32,9 @@ struct HttpOptions {
   std::chrono::seconds keepAliveTimeout{5};
   std::size_t keepAliveMaxCount = 100;
   std::size_t maxBodyBytes = 64 * 1024;
+  // Names the Host header may give besides address literals; empty: those
+  // of LocalHostNames().
+  std::vector<std::string> hostNames;
 };
 
 class HttpServer {

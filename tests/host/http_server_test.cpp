@@ -330,6 +330,83 @@ TEST_F(HostHttp, FrontEndFilesAreServed) {
   EXPECT_EQ(Code(Body(GetPath("/webapi/query.cgi"))), 106);
 }
 
+TEST_F(HostHttp, EncodedControlCharactersInPathsAreRefused) {
+  StopServer();
+  zark::test::WriteFile("/tmp/www/index.html", "<p>front end</p>\n");
+  HttpOptions options;
+  options.wwwFolder = "/tmp/www";
+  StartServer(options);
+  for (const char *path :
+       {"/index.html%00.png", "/index.html%00", "/%0aindex.html",
+        "/index.html%7f", "/webapi/query.cgi%00"}) {
+    httplib::Result result = GetPath(path);
+    ASSERT_TRUE(result) << path;
+    EXPECT_EQ(result->status, 400) << path;
+    EXPECT_EQ(result->body.find("front end"), std::string::npos) << path;
+  }
+  httplib::Result index = GetPath("/index.html");
+  ASSERT_TRUE(index);
+  EXPECT_EQ(index->body, "<p>front end</p>\n");
+}
+
+TEST_F(HostHttp, LoginFromAnotherSitesPageIsRefused) {
+  const std::string login =
+      "method=login&account=admin&passwd=" + FormEncode(test::kAdmin.password);
+  for (const char *origin :
+       {"http://evil.example", "null", "http://127.0.0.1.evil.example"}) {
+    httplib::Headers headers = {{"Origin", origin}};
+    httplib::Result result =
+        mClient->Post("/webapi/auth.cgi", headers, login, kForm);
+    ASSERT_TRUE(result) << origin;
+    EXPECT_EQ(result->status, 403) << origin;
+    EXPECT_TRUE(result->get_header_value("Set-Cookie").empty()) << origin;
+    Json::Value answer = Body(result);
+    EXPECT_EQ(Code(answer), 105);
+    EXPECT_EQ(answer["error"]["errors"]["reason"].asString(), "origin");
+  }
+  EXPECT_EQ(mSessions.Count(), 0u);
+  // The host's own page sends its own origin.
+  httplib::Headers own = {
+      {"Origin", "http://127.0.0.1:" + std::to_string(mServer->Port())}};
+  Json::Value answer =
+      Body(mClient->Post("/webapi/auth.cgi", own, login, kForm));
+  EXPECT_TRUE(answer["success"].asBool()) << answer;
+}
+
+TEST_F(HostHttp, CallsFromAnotherSitesPageAreRefused) {
+  HttpSession admin = LoginOverHttp(test::kAdmin);
+  httplib::Headers headers = SessionHeaders(&admin);
+  headers.emplace("Origin", "https://evil.example");
+  httplib::Result result =
+      mClient->Post("/webapi/entry.cgi", headers,
+                    "api=Test.Echo&version=1&method=echo", kForm);
+  ASSERT_TRUE(result);
+  EXPECT_EQ(result->status, 403);
+  EXPECT_EQ(Code(Body(result)), 105);
+}
+
+TEST_F(HostHttp, RequestsNamingAnotherHostAreRefused) {
+  const std::string port = std::to_string(mServer->Port());
+  for (const std::string &host : std::vector<std::string>{
+           "evil.example:" + port, "evil.example",
+           "127.0.0.1.nip.example:" + port, "[::1:" + port}) {
+    httplib::Headers headers = {{"Host", host}};
+    httplib::Result result = mClient->Get("/webapi/query.cgi", headers);
+    ASSERT_TRUE(result) << host;
+    EXPECT_EQ(result->status, 421) << host;
+    EXPECT_EQ(Body(result)["error"]["errors"]["reason"].asString(), "host");
+  }
+  for (const std::string &host :
+       std::vector<std::string>{"localhost:" + port, "127.0.0.1:" + port,
+                                "LOCALHOST", "[::1]:" + port}) {
+    httplib::Headers headers = {{"Host", host}};
+    httplib::Result result = mClient->Get("/webapi/query.cgi", headers);
+    ASSERT_TRUE(result) << host;
+    EXPECT_EQ(result->status, 200) << host;
+    EXPECT_EQ(Code(Body(result)), 106) << host;
+  }
+}
+
 TEST_F(HostHttp, FrontEndThatWouldHideTheApiIsNotServed) {
   StopServer();
   zark::test::ClearLogs();
