@@ -1,8 +1,13 @@
 #include "http_server.h"
 
 #include "host_log.h"
+#include "request_guard.h"
+
+#include "klibc_text.h"
 
 #include <httplib.h>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
 #include <sys/socket.h>
 
 #include <cerrno>
@@ -128,15 +133,28 @@ void ApplyLimits(httplib::Server &server, const HttpOptions &options) {
                               {"Referrer-Policy", "no-referrer"}});
 }
 
+// Why a body was not read whole.
+enum class BodyRefusal {
+  None,
+  Broken,   // the client sent a broken body or went away
+  TooLarge, // beyond maxBodyBytes
+  TooSlow,  // not whole within bodyTimeout
+};
+
 // The answer when a POST body could not be read whole.
-void SendBodyRefusal(httplib::Response &response, std::size_t maxBodyBytes) {
-  // 413 from the library: more than the payload bound. Otherwise the
-  // client sent a broken body or went away.
-  if (response.status == 413) {
+void SendBodyRefusal(httplib::Response &response, BodyRefusal refusal,
+                     std::size_t maxBodyBytes) {
+  // The rest of the body stays unread: the connection ends with the answer.
+  response.set_header("Connection", "close");
+  if (refusal == BodyRefusal::TooLarge) {
     Json::Value errors(Json::objectValue);
     errors["limit"] = "body";
     errors["max"] = static_cast<Json::UInt64>(maxBodyBytes);
     SendJson(response, 413, ErrorAnswer(ZARK::WEBAPI_ERR_TOO_LARGE, errors));
+  } else if (refusal == BodyRefusal::TooSlow) {
+    Json::Value errors(Json::objectValue);
+    errors["reason"] = "body_timeout";
+    SendJson(response, 408, ErrorAnswer(ZARK::WEBAPI_ERR_BAD_REQUEST, errors));
   } else {
     Json::Value errors(Json::objectValue);
     errors["reason"] = "body";
@@ -146,7 +164,9 @@ void SendBodyRefusal(httplib::Response &response, std::size_t maxBodyBytes) {
 
 // GET and POST of the API endpoints, answered by handler.
 void RouteApi(httplib::Server &server, const RequestHandler &handler,
-              std::size_t maxBodyBytes) {
+              const HttpOptions &options) {
+  const std::size_t maxBodyBytes = options.maxBodyBytes;
+  const std::chrono::milliseconds bodyTimeout = options.bodyTimeout;
   server.Get(kApiPattern, [&handler](const httplib::Request &request,
                                      httplib::Response &response) {
     ReceivedRequest received;
@@ -154,27 +174,43 @@ void RouteApi(httplib::Server &server, const RequestHandler &handler,
     SendAnswer(response, handler.Handle(web));
   });
 
-  server.Post(kApiPattern,
-              [&handler, maxBodyBytes](const httplib::Request &request,
-                                       httplib::Response &response,
-                                       const httplib::ContentReader &reader) {
-                ReceivedRequest received;
-                bool read =
-                    reader([&received](const char *data, std::size_t length) {
-                      received.body.append(data, length);
-                      return true;
-                    });
-                if (!read) {
-                  SendBodyRefusal(response, maxBodyBytes);
-                  return;
-                }
-                WebRequest web = ToWebRequest(request, received);
-                web.isPost = true;
-                web.body = received.body;
-                received.contentType = request.get_header_value("Content-Type");
-                web.contentType = received.contentType;
-                SendAnswer(response, handler.Handle(web));
-              });
+  server.Post(kApiPattern, [&handler, maxBodyBytes,
+                            bodyTimeout](const httplib::Request &request,
+                                         httplib::Response &response,
+                                         const httplib::ContentReader &reader) {
+    ReceivedRequest received;
+    // The library bounds only bodies with a Content-Length; a chunked body
+    // or one read until the client closes is bounded here, piece by piece
+    // as it arrives, in size and in time (a body trickled a byte at a time
+    // never meets the read timeout, which applies to each read).
+    const auto deadline = std::chrono::steady_clock::now() + bodyTimeout;
+    BodyRefusal refusal = BodyRefusal::None;
+    bool read = reader([&](const char *data, std::size_t length) {
+      if (length > maxBodyBytes - received.body.size()) {
+        refusal = BodyRefusal::TooLarge;
+        return false;
+      }
+      if (std::chrono::steady_clock::now() > deadline) {
+        refusal = BodyRefusal::TooSlow;
+        return false;
+      }
+      received.body.append(data, length);
+      return true;
+    });
+    if (!read) {
+      if (refusal == BodyRefusal::None && response.status == 413) {
+        refusal = BodyRefusal::TooLarge;
+      }
+      SendBodyRefusal(response, refusal, maxBodyBytes);
+      return;
+    }
+    WebRequest web = ToWebRequest(request, received);
+    web.isPost = true;
+    web.body = received.body;
+    received.contentType = request.get_header_value("Content-Type");
+    web.contentType = received.contentType;
+    SendAnswer(response, handler.Handle(web));
+  });
 }
 
 // A JSON body for an error the library answered under /webapi/.
@@ -211,6 +247,92 @@ void AnswerException(const httplib::Request &request,
   HOST_LOG(LOG_ERR, "request for %s failed: %s", request.path.c_str(),
            what.c_str());
   SendJson(response, 500, ErrorAnswer(ZARK::WEBAPI_ERR_UNKNOWN));
+}
+
+// A refusal of the request guard: JSON under /webapi/, plain text elsewhere.
+httplib::Server::HandlerResponse Refuse(const httplib::Request &request,
+                                        httplib::Response &response, int status,
+                                        int code, const char *reason) {
+  // The body, if any, is left unread: the connection ends with the answer.
+  response.set_header("Connection", "close");
+  if (IsApiPath(request.path)) {
+    Json::Value errors(Json::objectValue);
+    errors["reason"] = reason;
+    SendJson(response, status, ErrorAnswer(code, errors));
+  } else {
+    response.status = status;
+    response.set_content(std::string(reason) + " refused\n", "text/plain");
+  }
+  return httplib::Server::HandlerResponse::Handled;
+}
+
+// 431 for headers beyond the bounds (JSON under /webapi/).
+httplib::Server::HandlerResponse RefuseHeaders(const httplib::Request &request,
+                                               httplib::Response &response,
+                                               std::size_t max, bool count) {
+  response.set_header("Connection", "close");
+  if (!IsApiPath(request.path)) {
+    response.status = 431;
+    response.set_content("headers refused\n", "text/plain");
+    return httplib::Server::HandlerResponse::Handled;
+  }
+  Json::Value errors(Json::objectValue);
+  errors["limit"] = count ? "header_count" : "headers";
+  errors["max"] = static_cast<Json::UInt64>(max);
+  SendJson(response, 431, ErrorAnswer(ZARK::WEBAPI_ERR_TOO_LARGE, errors));
+  return httplib::Server::HandlerResponse::Handled;
+}
+
+// Every request, before it is routed (and before its body is read): too
+// many or too large headers, a compressed body, control characters in the
+// path, a Host that is not this machine, an Origin of another site.
+void GuardRequests(httplib::Server &server, const HttpOptions &options,
+                   std::vector<std::string> names) {
+  server.set_pre_routing_handler(
+      [names = std::move(names), maxCount = options.maxHeaderCount,
+       maxBytes = options.maxHeaderBytes](const httplib::Request &request,
+                                          httplib::Response &response) {
+        std::size_t headerBytes = 0;
+        for (const auto &[name, value] : request.headers) {
+          headerBytes += name.size() + value.size();
+        }
+        if (request.headers.size() > maxCount || headerBytes > maxBytes) {
+          return RefuseHeaders(request, response,
+                               request.headers.size() > maxCount ? maxCount
+                                                                 : maxBytes,
+                               request.headers.size() > maxCount);
+        }
+        // The library would inflate a gzip or brotli body before any bound
+        // applies (61 KB of gzip make 60 MB): refused unread.
+        if (request.has_header("Content-Encoding") &&
+            !klibc::EqualsIgnoringCase(
+                request.get_header_value("Content-Encoding"), "identity")) {
+          return Refuse(request, response, 415, ZARK::WEBAPI_ERR_BAD_REQUEST,
+                        "content_encoding");
+        }
+        if (HasControlCharacter(request.path)) {
+          return Refuse(request, response, 400, ZARK::WEBAPI_ERR_BAD_REQUEST,
+                        "path");
+        }
+        const std::string host = request.get_header_value("Host");
+        if (request.get_header_value_count("Host") > 1 ||
+            !IsAllowedHost(host, names)) {
+          HOST_LOG(LOG_NOTICE, "request from %s refused: not this host",
+                   request.remote_addr.c_str());
+          return Refuse(request, response, 421, ZARK::WEBAPI_ERR_NOT_ALLOWED,
+                        "host");
+        }
+        // Browsers send Origin with every POST and every cross-site call;
+        // a client that sends none is not a browser page of another site.
+        if (request.has_header("Origin") &&
+            !IsSameOrigin(request.get_header_value("Origin"), host)) {
+          HOST_LOG(LOG_NOTICE, "request from %s refused: another site's page",
+                   request.remote_addr.c_str());
+          return Refuse(request, response, 403, ZARK::WEBAPI_ERR_NOT_ALLOWED,
+                        "origin");
+        }
+        return httplib::Server::HandlerResponse::Unhandled;
+      });
 }
 
 // The front end from the www folder, or the built-in page when it cannot
@@ -257,7 +379,10 @@ HttpServer::~HttpServer() {
 void HttpServer::Route() {
   httplib::Server &server = *mServer;
   ApplyLimits(server, mOptions);
-  RouteApi(server, mHandler, mOptions.maxBodyBytes);
+  GuardRequests(server, mOptions,
+                mOptions.hostNames.empty() ? LocalHostNames()
+                                           : mOptions.hostNames);
+  RouteApi(server, mHandler, mOptions);
   // Failures the library answers itself (bounds, unknown paths under
   // /webapi/) get a JSON body there too.
   httplib::Server::HandlerWithResponse errorHandler = AnswerLibraryError;
@@ -276,6 +401,12 @@ bool HttpServer::Bind() {
   auto listening = std::make_shared<int>(-1);
   mServer->set_socket_options([listening](socket_t sock) {
     httplib::default_socket_options(sock);
+    // The library writes an answer's headers and body in two writes:
+    // without TCP_NODELAY the second waits for the client's delayed ACK
+    // (40 ms) on a kept-alive connection. Accepted sockets inherit it from
+    // the listening one.
+    const int on = 1;
+    (void)::setsockopt(sock, IPPROTO_TCP, TCP_NODELAY, &on, sizeof on);
     *listening = sock;
   });
   if (mOptions.port == 0) {

@@ -12,6 +12,7 @@
 #include <filesystem>
 #include <memory>
 #include <string>
+#include <vector>
 
 namespace httplib {
 class Server;
@@ -30,7 +31,17 @@ struct HttpOptions {
   std::chrono::seconds writeTimeout{10};
   std::chrono::seconds keepAliveTimeout{5};
   std::size_t keepAliveMaxCount = 100;
+  // Bounds every request body while it arrives, whatever its framing
+  // (length, chunked, or read until the client closes).
   std::size_t maxBodyBytes = 64 * 1024;
+  // A request body must have arrived whole this long after its headers.
+  std::chrono::milliseconds bodyTimeout{20000};
+  // Header lines of a request, and their names and values together.
+  std::size_t maxHeaderCount = 64;
+  std::size_t maxHeaderBytes = 16 * 1024;
+  // Names the Host header may give besides address literals; empty: those
+  // of LocalHostNames().
+  std::vector<std::string> hostNames;
 };
 
 class HttpServer {

@@ -24,7 +24,10 @@ LoginOutcome LoginService::Login(std::string_view account,
   const std::string_view throttleName =
       IsValidAccountName(account) ? account : std::string_view("(not a name)");
   LoginOutcome outcome;
-  std::chrono::seconds wait = mThrottle.RetryAfter(throttleName, clientAddress);
+  // The attempt is counted as a failure here, in the same step as the
+  // check, before the password check that takes milliseconds: concurrent
+  // guesses at the end of a wait cannot all get through.
+  std::chrono::seconds wait = mThrottle.Claim(throttleName, clientAddress);
   if (wait.count() > 0) {
     HOST_LOG(LOG_NOTICE,
              "login from %s refused: %lld s to wait after failed logins",
@@ -47,14 +50,12 @@ LoginOutcome LoginService::Login(std::string_view account,
                             });
   if (found == accounts->end()) {
     VerifyAgainstDummy(password);
-    mThrottle.RecordFailure(throttleName, clientAddress);
     HOST_LOG(LOG_NOTICE, "login from %s refused: unknown account",
              address.c_str());
     outcome.result = LoginOutcome::Result::BadCredentials;
     return outcome;
   }
   if (!VerifyPassword(password, found->hash)) {
-    mThrottle.RecordFailure(throttleName, clientAddress);
     HOST_LOG(LOG_NOTICE, "login of %s from %s refused: wrong password",
              found->user.c_str(), address.c_str());
     outcome.result = LoginOutcome::Result::BadCredentials;

@@ -34,10 +34,11 @@ public:
   LoginService(std::filesystem::path accountsFile, SessionStore &sessions,
                LoginThrottle &throttle);
 
-  // While the throttle asks the account or the address to wait, the password
-  // is not even checked. An unknown account costs the time of a password
-  // check, like a known one. BadCredentials counts as a failure for the
-  // throttle; Ok clears the account's and the address's counts. Logs every
+  // While the throttle asks the address (or, for an address with failures on
+  // record, the account) to wait, the password is not even checked. An
+  // unknown account costs the time of a password check, like a known one.
+  // Every checked attempt is counted as a failure before the check; Ok
+  // clears the account's and the address's counts. Logs every
   // outcome, naming known accounts and the address, never the password; the
   // name typed for an unknown account is not logged (it may be a password typed
   // into the wrong field).

@@ -1,6 +1,10 @@
 #include "login_throttle.h"
 
+#include <arpa/inet.h>
+
 #include <algorithm>
+#include <array>
+#include <cstring>
 
 namespace zark::host {
 namespace {
@@ -10,10 +14,34 @@ std::string AccountKey(std::string_view account) {
 }
 
 std::string AddressKey(std::string_view address) {
-  return "address " + std::string(address);
+  return "address " + ThrottleAddressKey(address);
 }
 
 } // namespace
+
+std::string ThrottleAddressKey(std::string_view address) {
+  const std::string text(address);
+  std::array<unsigned char, 16> bytes{};
+  if (text.find(':') == std::string::npos ||
+      inet_pton(AF_INET6, text.c_str(), bytes.data()) != 1) {
+    return text;
+  }
+  static constexpr unsigned char kMappedPrefix[12] = {0, 0, 0, 0, 0,    0,
+                                                      0, 0, 0, 0, 0xff, 0xff};
+  char printed[INET6_ADDRSTRLEN] = {};
+  if (std::memcmp(bytes.data(), kMappedPrefix, sizeof kMappedPrefix) == 0) {
+    if (inet_ntop(AF_INET, bytes.data() + 12, printed, sizeof printed) ==
+        nullptr) {
+      return text;
+    }
+    return printed;
+  }
+  std::fill(bytes.begin() + 8, bytes.end(), 0);
+  if (inet_ntop(AF_INET6, bytes.data(), printed, sizeof printed) == nullptr) {
+    return text;
+  }
+  return std::string(printed) + "/64";
+}
 
 LoginThrottle::LoginThrottle(const Clock &clock, ThrottlePolicy policy)
     : mClock(clock), mPolicy(policy) {}
@@ -29,18 +57,49 @@ void LoginThrottle::ForgetOldLocked(Clock::TimePoint now) {
   }
 }
 
+Clock::TimePoint::duration
+LoginThrottle::WaitLocked(const std::string &accountKey,
+                          const std::string &addressKey,
+                          Clock::TimePoint now) const {
+  Clock::TimePoint::duration wait{0};
+  auto address = mEntries.find(addressKey);
+  if (address == mEntries.end()) {
+    // A clean address: the account's ceiling does not apply to it.
+    return wait;
+  }
+  if (address->second.blockedUntil > now) {
+    wait = address->second.blockedUntil - now;
+  }
+  auto account = mEntries.find(accountKey);
+  if (address->second.failures > 0 && account != mEntries.end() &&
+      account->second.blockedUntil > now) {
+    wait = std::max(wait, account->second.blockedUntil - now);
+  }
+  return wait;
+}
+
 std::chrono::seconds LoginThrottle::RetryAfter(std::string_view account,
                                                std::string_view address) {
   std::lock_guard lock(mMutex);
+  return std::chrono::ceil<std::chrono::seconds>(
+      WaitLocked(AccountKey(account), AddressKey(address), mClock.Now()));
+}
+
+std::chrono::seconds LoginThrottle::Claim(std::string_view account,
+                                          std::string_view address) {
+  const std::string accountKey = AccountKey(account);
+  const std::string addressKey = AddressKey(address);
+  std::lock_guard lock(mMutex);
   const Clock::TimePoint now = mClock.Now();
-  Clock::TimePoint::duration wait{0};
-  for (const std::string &key : {AccountKey(account), AddressKey(address)}) {
-    auto it = mEntries.find(key);
-    if (it != mEntries.end() && it->second.blockedUntil > now) {
-      wait = std::max(wait, it->second.blockedUntil - now);
-    }
+  ForgetOldLocked(now);
+  Clock::TimePoint::duration wait = WaitLocked(accountKey, addressKey, now);
+  if (wait.count() > 0) {
+    return std::max(std::chrono::seconds(1),
+                    std::chrono::ceil<std::chrono::seconds>(wait));
   }
-  return std::chrono::ceil<std::chrono::seconds>(wait);
+  CountFailureLocked(accountKey, now);
+  CountFailureLocked(addressKey, now);
+  return std::chrono::seconds(0);
 }
 
 void LoginThrottle::CountFailureLocked(const std::string &key,
@@ -74,18 +133,22 @@ void LoginThrottle::CountFailureLocked(const std::string &key,
 
 void LoginThrottle::RecordFailure(std::string_view account,
                                   std::string_view address) {
+  const std::string accountKey = AccountKey(account);
+  const std::string addressKey = AddressKey(address);
   std::lock_guard lock(mMutex);
   const Clock::TimePoint now = mClock.Now();
   ForgetOldLocked(now);
-  CountFailureLocked(AccountKey(account), now);
-  CountFailureLocked(AddressKey(address), now);
+  CountFailureLocked(accountKey, now);
+  CountFailureLocked(addressKey, now);
 }
 
 void LoginThrottle::RecordSuccess(std::string_view account,
                                   std::string_view address) {
+  const std::string accountKey = AccountKey(account);
+  const std::string addressKey = AddressKey(address);
   std::lock_guard lock(mMutex);
-  mEntries.erase(AccountKey(account));
-  mEntries.erase(AddressKey(address));
+  mEntries.erase(accountKey);
+  mEntries.erase(addressKey);
 }
 
 } // namespace zark::host

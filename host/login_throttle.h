@@ -1,6 +1,19 @@
-// Slows down password guessing: consecutive failed logins are counted per
-// account name and per client address, and after a few of them further
-// attempts are refused for a time that doubles with each failure.
+// Slows down password guessing without handing a stranger a way to lock the
+// administrator out.
+//
+// Failed logins are counted per client address (an IPv6 address counts as
+// its /64 prefix, which one attacker holds whole) and per account name.
+// The address's count backs that address off: after a few failures, every
+// login from it waits, doubling with each further failure. The account's
+// count is a ceiling on top: while it is over its few free failures, an
+// address that already has a failure on record waits for the account too.
+// An address with no failure on record always gets its password checked, so
+// the right password from a clean address logs in whatever strangers did to
+// the account.
+//
+// An attempt is claimed (counted as a failure) in the same step as the
+// check that lets it through, before the password is checked: concurrent
+// guesses cannot all slip in at the end of a wait.
 #ifndef ZARK_HOST_LOGIN_THROTTLE_H
 #define ZARK_HOST_LOGIN_THROTTLE_H
 
@@ -33,10 +46,17 @@ public:
   LoginThrottle(const Clock &clock, ThrottlePolicy policy);
 
   // Whole seconds (rounded up) until a login for account from address may
-  // be tried again; 0 when it may be tried now. The longer of the account's
-  // and the address's waits.
+  // be tried again; 0 when it may be tried now: the address's own wait, or,
+  // when the address has a failure on record, the longer of it and the
+  // account's wait.
   [[nodiscard]] std::chrono::seconds RetryAfter(std::string_view account,
                                                 std::string_view address);
+
+  // One step: 0 when the attempt may go on, and then it is already counted
+  // as a failure of both (RecordSuccess undoes that); otherwise the wait
+  // RetryAfter would give, and nothing is counted.
+  [[nodiscard]] std::chrono::seconds Claim(std::string_view account,
+                                           std::string_view address);
 
   // A failed login: both counters go up, and from the freeFailures-th
   // consecutive failure on both wait firstDelay * 2^(count - freeFailures),
@@ -54,12 +74,20 @@ private:
   };
   void ForgetOldLocked(Clock::TimePoint now);
   void CountFailureLocked(const std::string &key, Clock::TimePoint now);
+  [[nodiscard]] Clock::TimePoint::duration
+  WaitLocked(const std::string &accountKey, const std::string &addressKey,
+             Clock::TimePoint now) const;
 
   const Clock &mClock;
   const ThrottlePolicy mPolicy;
   std::mutex mMutex;
   std::map<std::string, Entry, std::less<>> mEntries;
 };
+
+// The key an address is counted under: an IPv4 address as it is (also when
+// written as an IPv4-mapped IPv6 address), an IPv6 address as its /64
+// prefix ("2001:db8:1:2::/64"), anything else as it is.
+[[nodiscard]] std::string ThrottleAddressKey(std::string_view address);
 
 } // namespace zark::host
 

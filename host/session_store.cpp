@@ -1,5 +1,6 @@
 #include "session_store.h"
 
+#include "account_file.h"
 #include "host_log.h"
 #include "random_token.h"
 
@@ -39,10 +40,27 @@ std::optional<NewSession> SessionStore::Create(const SessionOwner &owner) {
   const Clock::TimePoint now = mClock.Now();
   DropExpiredLocked(now);
   if (mSessions.size() >= mPolicy.maxSessions && !mSessions.empty()) {
-    auto oldest = std::min_element(
-        mSessions.begin(), mSessions.end(), [](const auto &a, const auto &b) {
-          return a.second.lastUsed < b.second.lastUsed;
-        });
+    // The least recently used session that this login may push out: an
+    // administrator's login any session, another account's login only the
+    // sessions of accounts outside the group "admin", so that logins of an
+    // ordinary account cannot log an administrator out.
+    const bool mayDropAdmins = owner.group == kAdminGroup;
+    auto oldest = mSessions.end();
+    for (auto it = mSessions.begin(); it != mSessions.end(); ++it) {
+      if (!mayDropAdmins && it->second.owner.group == kAdminGroup) {
+        continue;
+      }
+      if (oldest == mSessions.end() ||
+          it->second.lastUsed < oldest->second.lastUsed) {
+        oldest = it;
+      }
+    }
+    if (oldest == mSessions.end()) {
+      HOST_LOG(LOG_NOTICE,
+               "no session for %s: %zu sessions held, all of administrators",
+               owner.account.c_str(), mSessions.size());
+      return std::nullopt;
+    }
     HOST_LOG(LOG_NOTICE, "session of %s dropped: %zu sessions held",
              oldest->second.owner.account.c_str(), mSessions.size());
     mSessions.erase(oldest);

@@ -47,8 +47,11 @@ class SessionStore {
 public:
   SessionStore(const Clock &clock, SessionPolicy policy);
 
-  // Opens a session for owner. nullopt (logged) when no random id or token
-  // could be made.
+  // Opens a session for owner. When maxSessions are held, the least
+  // recently used one goes; a login outside the group "admin" pushes out
+  // only sessions outside it too. nullopt (logged) when no random id or
+  // token could be made, or when every held session is an administrator's
+  // and owner is not one.
   [[nodiscard]] std::optional<NewSession> Create(const SessionOwner &owner);
 
   // Checks a call's session id and token. The token is compared in

@@ -10,6 +10,8 @@
 #include <syslog.h>
 
 #include <cerrno>
+#include <climits>
+#include <cmath>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -378,14 +380,17 @@ bool PortForwarding::GetPortfwdApplyStatus(std::string &stage,
   if (stage == "add") {
     fraction += 0.5;
   }
-  // Counts the library never writes (negative, or done above total) still
-  // give a percentage of 0 to 100; the conversion to int stays defined.
-  if (fraction < 0.0) {
-    fraction = 0.0;
-  } else if (fraction > 1.0) {
+  if (fraction > 1.0) {
     fraction = 1.0;
   }
-  percentage = static_cast<int>(fraction * 100);
+  // A negative count gives a negative percentage, as the formula says; one
+  // so large that it has no int is the lowest int, so that the conversion
+  // stays defined. fraction is at most 1.0, never NaN (total 0 is handled).
+  fraction = std::trunc(fraction * 100);
+  if (fraction < static_cast<double>(INT_MIN)) {
+    fraction = static_cast<double>(INT_MIN);
+  }
+  percentage = static_cast<int>(fraction);
   ret = true;
 End:
   if (NULL != fp) {

@@ -43,8 +43,11 @@ public:
   // "/tmp/pfProgress". False (error reported) on a bad record or an
   // unreadable progress file.
   bool StartPortForwardingStatus(Json::Value &out, const Json::Value &task);
-  // Stage ("del" or "add") and percentage (0 to 100) of the last line of
-  // "/tmp/pfProgress". False when the file cannot be read.
+  // Stage ("del" or "add") and percentage of the last line of
+  // "/tmp/pfProgress": done / total x 0.5 (0 when total is 0), plus 0.5 in
+  // the "add" stage, at most 1.0, times 100 truncated toward zero; negative
+  // when the file holds a negative count (at least INT_MIN). False when the
+  // file cannot be read.
   bool GetPortfwdApplyStatus(std::string &stage, int &percentage);
   // Readers of a task record's "data"; false (logged) when the value is
   // missing, of the wrong type, an empty status or a negative percentage.

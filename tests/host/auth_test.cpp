@@ -10,6 +10,10 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
+#include <thread>
+#include <vector>
+
 namespace zark::host {
 namespace {
 
@@ -208,6 +212,52 @@ TEST_F(HostAuth, GuessesFromOneAddressSlowEveryAccount) {
   mClientAddress = "127.0.0.2";
   EXPECT_TRUE(
       TryLogin("viewer", test::kViewer.password).body["success"].asBool());
+}
+
+TEST_F(HostAuth, StrangerRetryingEachWaitCannotKeepTheAdministratorOut) {
+  for (int round = 0; round < 34; ++round) {
+    LoginOutcome guess =
+        mLogins.Login("admin", "guess" + std::to_string(round), "192.0.2.66");
+    ASSERT_EQ(guess.result, LoginOutcome::Result::BadCredentials);
+    LoginOutcome real =
+        mLogins.Login("admin", test::kAdmin.password, "10.0.0.1");
+    EXPECT_EQ(real.result, LoginOutcome::Result::Ok) << "round " << round;
+    mClock.Advance(mThrottle.RetryAfter("admin", "192.0.2.66"));
+  }
+}
+
+TEST_F(HostAuth, ConcurrentGuessesAtTheEndOfAWaitAreNotAllChecked) {
+  for (int i = 0; i < 4; ++i) {
+    (void)mLogins.Login("admin", "guess", "192.0.2.66");
+  }
+  mClock.Advance(mThrottle.RetryAfter("admin", "192.0.2.66"));
+  std::atomic<int> checked{0};
+  std::vector<std::thread> guessers;
+  for (int i = 0; i < 8; ++i) {
+    guessers.emplace_back([this, &checked, i] {
+      LoginOutcome outcome =
+          mLogins.Login("admin", "guess" + std::to_string(i), "192.0.2.66");
+      if (outcome.result != LoginOutcome::Result::Throttled) {
+        ++checked;
+      }
+    });
+  }
+  for (std::thread &guesser : guessers) {
+    guesser.join();
+  }
+  EXPECT_EQ(checked.load(), 1);
+}
+
+TEST_F(HostAuth, OrdinaryLoginsDoNotLogTheAdministratorOut) {
+  Browser admin = Login(test::kAdmin);
+  for (int i = 0; i < 300; ++i) {
+    mClock.Advance(1ms);
+    ASSERT_TRUE(
+        mLogins.Login("viewer", test::kViewer.password, "10.0.0.2").result ==
+        LoginOutcome::Result::Ok);
+  }
+  EXPECT_TRUE(
+      Call(admin, "api=Test.Echo&version=1&method=echo")["success"].asBool());
 }
 
 TEST_F(HostAuth, LoginMustBeAPostWithThePasswordInTheBody) {

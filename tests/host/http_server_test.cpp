@@ -11,8 +11,19 @@
 
 #include <gtest/gtest.h>
 
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
 #include <chrono>
+#include <cstdint>
+#include <cstring>
 #include <thread>
+#include <vector>
 
 namespace zark::host {
 namespace {
@@ -25,6 +36,76 @@ constexpr const char *kForm = "application/x-www-form-urlencoded";
 struct HttpSession {
   std::string cookie; // "id=..."
   std::string token;
+};
+
+// A raw TCP connection to the server, for requests a well-behaved client
+// would not send. Every wait is bounded.
+class RawConnection {
+public:
+  explicit RawConnection(int port) {
+    mFd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_in address{};
+    address.sin_family = AF_INET;
+    address.sin_port = htons(static_cast<std::uint16_t>(port));
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    if (mFd < 0 || ::connect(mFd, reinterpret_cast<sockaddr *>(&address),
+                             sizeof address) != 0) {
+      ADD_FAILURE() << "cannot connect: " << std::strerror(errno);
+    }
+  }
+  ~RawConnection() {
+    if (mFd >= 0) {
+      ::close(mFd);
+    }
+  }
+  RawConnection(const RawConnection &) = delete;
+  RawConnection &operator=(const RawConnection &) = delete;
+
+  // False when the server no longer takes bytes (closed, or not reading).
+  bool Send(const std::string &bytes) {
+    std::size_t sent = 0;
+    while (sent < bytes.size()) {
+      pollfd ready{mFd, POLLOUT, 0};
+      if (::poll(&ready, 1, 1000) != 1 || (ready.revents & POLLOUT) == 0) {
+        return false;
+      }
+      ssize_t n = ::send(mFd, bytes.data() + sent, bytes.size() - sent,
+                         MSG_NOSIGNAL | MSG_DONTWAIT);
+      if (n <= 0) {
+        return false;
+      }
+      sent += static_cast<std::size_t>(n);
+    }
+    return true;
+  }
+
+  // What the server answered within wait (empty when nothing came).
+  std::string Answer(std::chrono::milliseconds wait) {
+    std::string answer;
+    const auto deadline = std::chrono::steady_clock::now() + wait;
+    for (;;) {
+      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+          deadline - std::chrono::steady_clock::now());
+      pollfd ready{mFd, POLLIN, 0};
+      if (left.count() <= 0 ||
+          ::poll(&ready, 1, static_cast<int>(left.count())) != 1) {
+        return answer;
+      }
+      char buffer[4096];
+      ssize_t n = ::recv(mFd, buffer, sizeof buffer, MSG_DONTWAIT);
+      if (n <= 0) {
+        return answer;
+      }
+      answer.append(buffer, static_cast<std::size_t>(n));
+      if (answer.find("\r\n\r\n") != std::string::npos &&
+          answer.find("}") != std::string::npos) {
+        return answer;
+      }
+    }
+  }
+
+private:
+  int mFd = -1;
 };
 
 class HostHttp : public test::HostFixture {
@@ -296,6 +377,105 @@ TEST_F(HostHttp, BodyBeyondTheBoundIs413With108) {
   EXPECT_TRUE(Entry(admin, fits)["success"].asBool());
 }
 
+TEST_F(HostHttp, ChunkedBodyIsBoundedWhileItArrives) {
+  RawConnection connection(mServer->Port());
+  ASSERT_TRUE(
+      connection.Send("POST /webapi/auth.cgi HTTP/1.1\r\nHost: 127.0.0.1\r\n"
+                      "Content-Type: application/x-www-form-urlencoded\r\n"
+                      "Transfer-Encoding: chunked\r\n\r\n"));
+  // Twice the bound in chunks of 8 KiB, and never the last chunk.
+  const std::string chunk = "2000\r\n" + std::string(8192, 'a') + "\r\n";
+  for (int i = 0; i < 16 && connection.Send(chunk); ++i) {
+  }
+  std::string answer = connection.Answer(std::chrono::seconds(3));
+  EXPECT_EQ(answer.rfind("HTTP/1.1 413", 0), 0u) << answer.substr(0, 200);
+  EXPECT_NE(answer.find("\"limit\":\"body\""), std::string::npos);
+}
+
+TEST_F(HostHttp, BodyWithoutLengthIsBoundedWhileItArrives) {
+  RawConnection connection(mServer->Port());
+  ASSERT_TRUE(connection.Send(
+      "POST /webapi/auth.cgi HTTP/1.1\r\nHost: 127.0.0.1\r\n"
+      "Content-Type: application/x-www-form-urlencoded\r\n\r\n"));
+  for (int i = 0; i < 16 && connection.Send(std::string(8192, 'a')); ++i) {
+  }
+  std::string answer = connection.Answer(std::chrono::seconds(3));
+  EXPECT_EQ(answer.rfind("HTTP/1.1 413", 0), 0u) << answer.substr(0, 200);
+}
+
+TEST_F(HostHttp, TrickledBodyEndsAtItsDeadline) {
+  StopServer();
+  HttpOptions options;
+  options.bodyTimeout = std::chrono::milliseconds(500);
+  StartServer(options);
+  RawConnection connection(mServer->Port());
+  ASSERT_TRUE(
+      connection.Send("POST /webapi/auth.cgi HTTP/1.1\r\nHost: 127.0.0.1\r\n"
+                      "Content-Type: application/x-www-form-urlencoded\r\n"
+                      "Content-Length: 100\r\n\r\n"));
+  // One byte every 100 ms: each read is far within the read timeout.
+  std::string answer;
+  for (int i = 0; i < 40 && answer.empty(); ++i) {
+    if (!connection.Send("a")) {
+      break;
+    }
+    answer = connection.Answer(std::chrono::milliseconds(100));
+  }
+  if (answer.empty()) {
+    answer = connection.Answer(std::chrono::seconds(1));
+  }
+  EXPECT_EQ(answer.rfind("HTTP/1.1 408", 0), 0u) << answer.substr(0, 200);
+  EXPECT_NE(answer.find("body_timeout"), std::string::npos);
+}
+
+TEST_F(HostHttp, CompressedBodiesAreRefusedUnread) {
+  for (const char *encoding : {"gzip", "deflate", "br", "GZIP"}) {
+    httplib::Headers headers = {{"Content-Encoding", encoding}};
+    httplib::Result result = mClient->Post("/webapi/auth.cgi", headers,
+                                           std::string(1000, '\x1f'), kForm);
+    ASSERT_TRUE(result) << encoding;
+    EXPECT_EQ(result->status, 415) << encoding;
+    EXPECT_EQ(Body(result)["error"]["errors"]["reason"].asString(),
+              "content_encoding");
+  }
+}
+
+TEST_F(HostHttp, TooManyHeadersAre431) {
+  httplib::Headers headers;
+  for (int i = 0; i < 100; ++i) {
+    headers.emplace("X-Filler-" + std::to_string(i), "v");
+  }
+  httplib::Result result = mClient->Get("/webapi/query.cgi", headers);
+  ASSERT_TRUE(result);
+  EXPECT_EQ(result->status, 431);
+  Json::Value answer = Body(result);
+  EXPECT_EQ(Code(answer), 108);
+  EXPECT_EQ(answer["error"]["errors"]["limit"].asString(), "header_count");
+  // Outside the API too.
+  httplib::Result page = mClient->Get("/", headers);
+  ASSERT_TRUE(page);
+  EXPECT_EQ(page->status, 431);
+}
+
+TEST_F(HostHttp, KeptAliveRequestsAreNotHeldByDelayedAcks) {
+  mClient->set_keep_alive(true);
+  // The client's own request leaves in one segment after another too.
+  mClient->set_tcp_nodelay(true);
+  std::vector<double> milliseconds;
+  for (int i = 0; i < 11; ++i) {
+    const auto start = std::chrono::steady_clock::now();
+    httplib::Result result = PostForm("/webapi/query.cgi", "a=1");
+    ASSERT_TRUE(result);
+    milliseconds.push_back(std::chrono::duration<double, std::milli>(
+                               std::chrono::steady_clock::now() - start)
+                               .count());
+  }
+  // Without TCP_NODELAY every request after the first waits about 40 ms for
+  // the client's delayed ACK.
+  std::sort(milliseconds.begin() + 1, milliseconds.end());
+  EXPECT_LT(milliseconds[6], 20.0);
+}
+
 TEST_F(HostHttp, UnknownApiPathGetsAJsonError) {
   httplib::Result result = GetPath("/webapi/other.cgi");
   ASSERT_TRUE(result);
@@ -328,6 +508,83 @@ TEST_F(HostHttp, FrontEndFilesAreServed) {
   EXPECT_EQ(escape->status, 404);
   // The API is still there.
   EXPECT_EQ(Code(Body(GetPath("/webapi/query.cgi"))), 106);
+}
+
+TEST_F(HostHttp, EncodedControlCharactersInPathsAreRefused) {
+  StopServer();
+  zark::test::WriteFile("/tmp/www/index.html", "<p>front end</p>\n");
+  HttpOptions options;
+  options.wwwFolder = "/tmp/www";
+  StartServer(options);
+  for (const char *path :
+       {"/index.html%00.png", "/index.html%00", "/%0aindex.html",
+        "/index.html%7f", "/webapi/query.cgi%00"}) {
+    httplib::Result result = GetPath(path);
+    ASSERT_TRUE(result) << path;
+    EXPECT_EQ(result->status, 400) << path;
+    EXPECT_EQ(result->body.find("front end"), std::string::npos) << path;
+  }
+  httplib::Result index = GetPath("/index.html");
+  ASSERT_TRUE(index);
+  EXPECT_EQ(index->body, "<p>front end</p>\n");
+}
+
+TEST_F(HostHttp, LoginFromAnotherSitesPageIsRefused) {
+  const std::string login =
+      "method=login&account=admin&passwd=" + FormEncode(test::kAdmin.password);
+  for (const char *origin :
+       {"http://evil.example", "null", "http://127.0.0.1.evil.example"}) {
+    httplib::Headers headers = {{"Origin", origin}};
+    httplib::Result result =
+        mClient->Post("/webapi/auth.cgi", headers, login, kForm);
+    ASSERT_TRUE(result) << origin;
+    EXPECT_EQ(result->status, 403) << origin;
+    EXPECT_TRUE(result->get_header_value("Set-Cookie").empty()) << origin;
+    Json::Value answer = Body(result);
+    EXPECT_EQ(Code(answer), 105);
+    EXPECT_EQ(answer["error"]["errors"]["reason"].asString(), "origin");
+  }
+  EXPECT_EQ(mSessions.Count(), 0u);
+  // The host's own page sends its own origin.
+  httplib::Headers own = {
+      {"Origin", "http://127.0.0.1:" + std::to_string(mServer->Port())}};
+  Json::Value answer =
+      Body(mClient->Post("/webapi/auth.cgi", own, login, kForm));
+  EXPECT_TRUE(answer["success"].asBool()) << answer;
+}
+
+TEST_F(HostHttp, CallsFromAnotherSitesPageAreRefused) {
+  HttpSession admin = LoginOverHttp(test::kAdmin);
+  httplib::Headers headers = SessionHeaders(&admin);
+  headers.emplace("Origin", "https://evil.example");
+  httplib::Result result =
+      mClient->Post("/webapi/entry.cgi", headers,
+                    "api=Test.Echo&version=1&method=echo", kForm);
+  ASSERT_TRUE(result);
+  EXPECT_EQ(result->status, 403);
+  EXPECT_EQ(Code(Body(result)), 105);
+}
+
+TEST_F(HostHttp, RequestsNamingAnotherHostAreRefused) {
+  const std::string port = std::to_string(mServer->Port());
+  for (const std::string &host : std::vector<std::string>{
+           "evil.example:" + port, "evil.example",
+           "127.0.0.1.nip.example:" + port, "[::1:" + port}) {
+    httplib::Headers headers = {{"Host", host}};
+    httplib::Result result = mClient->Get("/webapi/query.cgi", headers);
+    ASSERT_TRUE(result) << host;
+    EXPECT_EQ(result->status, 421) << host;
+    EXPECT_EQ(Body(result)["error"]["errors"]["reason"].asString(), "host");
+  }
+  for (const std::string &host :
+       std::vector<std::string>{"localhost:" + port, "127.0.0.1:" + port,
+                                "LOCALHOST", "[::1]:" + port}) {
+    httplib::Headers headers = {{"Host", host}};
+    httplib::Result result = mClient->Get("/webapi/query.cgi", headers);
+    ASSERT_TRUE(result) << host;
+    EXPECT_EQ(result->status, 200) << host;
+    EXPECT_EQ(Code(Body(result)), 106) << host;
+  }
 }
 
 TEST_F(HostHttp, FrontEndThatWouldHideTheApiIsNotServed) {

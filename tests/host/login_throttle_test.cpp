@@ -1,9 +1,14 @@
-// Login throttling: waits per account and per address, doubling, capped,
-// cleared by a success, forgotten after a quiet hour.
+// Login throttling: waits per address, the account's ceiling for addresses
+// with failures on record, doubling, capped, cleared by a success, forgotten
+// after a quiet hour; attempts claimed in the same step as the check.
 #include "fake_clock.h"
 #include "login_throttle.h"
 
 #include <gtest/gtest.h>
+
+#include <atomic>
+#include <thread>
+#include <vector>
 
 namespace zark::host {
 namespace {
@@ -52,12 +57,66 @@ TEST_F(HostThrottle, WaitEndsWithTime) {
   EXPECT_EQ(Wait("admin", "10.0.0.1"), 0s);
 }
 
-TEST_F(HostThrottle, AccountIsSlowedFromEveryAddress) {
+TEST_F(HostThrottle, AccountCeilingSlowsAddressesWithFailuresOnly) {
   Fail("admin", "10.0.0.1");
   Fail("admin", "10.0.0.2");
   Fail("admin", "10.0.0.3");
-  EXPECT_EQ(Wait("admin", "10.0.0.9"), 2s);
+  // Each of these addresses failed once: the account's wait holds them.
+  EXPECT_EQ(Wait("admin", "10.0.0.1"), 2s);
+  EXPECT_EQ(Wait("admin", "10.0.0.3"), 2s);
+  // A clean address gets its password checked: the right one logs in.
+  EXPECT_EQ(Wait("admin", "10.0.0.9"), 0s);
   EXPECT_EQ(Wait("other", "10.0.0.1"), 0s);
+}
+
+TEST_F(HostThrottle, StrangerCannotKeepACleanAddressOut) {
+  // One guess from the stranger's address each time its wait runs out.
+  for (int round = 0; round < 20; ++round) {
+    std::chrono::seconds wait = Wait("admin", "192.0.2.66");
+    mClock.Advance(wait);
+    EXPECT_EQ(mThrottle.Claim("admin", "192.0.2.66"), 0s);
+    EXPECT_EQ(mThrottle.Claim("admin", "10.0.0.1"), 0s) << "round " << round;
+    mThrottle.RecordSuccess("admin", "10.0.0.1");
+  }
+}
+
+TEST_F(HostThrottle, ClaimCountsTheAttemptBeforeItIsChecked) {
+  Fail("admin", "10.0.0.1", 2);
+  EXPECT_EQ(mThrottle.Claim("admin", "10.0.0.1"), 0s);
+  // The claimed attempt is the third failure already.
+  EXPECT_EQ(mThrottle.Claim("admin", "10.0.0.1"), 2s);
+  EXPECT_EQ(Wait("admin", "10.0.0.1"), 2s);
+  mThrottle.RecordSuccess("admin", "10.0.0.1");
+  EXPECT_EQ(Wait("admin", "10.0.0.1"), 0s);
+}
+
+TEST_F(HostThrottle, ConcurrentClaimsAtTheEndOfAWaitLetOneThrough) {
+  Fail("admin", "10.0.0.1", 4);
+  mClock.Advance(Wait("admin", "10.0.0.1"));
+  std::atomic<int> through{0};
+  std::vector<std::thread> guessers;
+  for (int i = 0; i < 8; ++i) {
+    guessers.emplace_back([this, &through] {
+      if (mThrottle.Claim("admin", "10.0.0.1") == 0s) {
+        ++through;
+      }
+    });
+  }
+  for (std::thread &guesser : guessers) {
+    guesser.join();
+  }
+  EXPECT_EQ(through.load(), 1);
+}
+
+TEST_F(HostThrottle, Ipv6AddressesCountByTheirSlash64) {
+  EXPECT_EQ(ThrottleAddressKey("2001:db8:1:2:aaaa::1"), "2001:db8:1:2::/64");
+  EXPECT_EQ(ThrottleAddressKey("::ffff:192.0.2.7"), "192.0.2.7");
+  EXPECT_EQ(ThrottleAddressKey("192.0.2.7"), "192.0.2.7");
+  Fail("a", "2001:db8:1:2::1");
+  Fail("b", "2001:db8:1:2::2");
+  Fail("c", "2001:db8:1:2:ffff::3");
+  EXPECT_EQ(Wait("admin", "2001:db8:1:2::99"), 2s);
+  EXPECT_EQ(Wait("admin", "2001:db8:1:3::1"), 0s);
 }
 
 TEST_F(HostThrottle, AddressIsSlowedForEveryAccount) {
@@ -94,7 +153,7 @@ TEST_F(HostThrottle, CountersAreBounded) {
   // Two new counters per failure push out the oldest ones.
   small.RecordFailure("x", "10.0.0.2");
   small.RecordFailure("y", "10.0.0.3");
-  EXPECT_EQ(small.RetryAfter("admin", "10.0.0.9"), 0s);
+  EXPECT_EQ(small.RetryAfter("admin", "10.0.0.1"), 0s);
 }
 
 } // namespace

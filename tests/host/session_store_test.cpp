@@ -142,6 +142,37 @@ TEST_F(HostSession, LeastRecentlyUsedGoesBeyondTheBound) {
   EXPECT_EQ(Check(fourth), SessionCheck::Ok);
 }
 
+TEST_F(HostSession, OrdinaryLoginsNeverPushOutAnAdministrator) {
+  NewSession admin = Open("admin", "admin");
+  mClock.Advance(1s);
+  NewSession viewer = Open("viewer", "users");
+  // Many logins of an ordinary account, each newer than the administrator's
+  // session: they push out each other only.
+  for (int i = 0; i < 256; ++i) {
+    mClock.Advance(1s);
+    Open("viewer", "users");
+  }
+  EXPECT_EQ(mSessions.Count(), 3u);
+  EXPECT_EQ(Check(admin), SessionCheck::Ok);
+  EXPECT_EQ(Check(viewer), SessionCheck::NoSession);
+}
+
+TEST_F(HostSession, OrdinaryLoginIsRefusedWhenOnlyAdministratorsHold) {
+  NewSession first = Open("a", "admin");
+  NewSession second = Open("b", "admin");
+  NewSession third = Open("c", "admin");
+  EXPECT_FALSE(mSessions.Create({"viewer", "users"}).has_value());
+  EXPECT_EQ(Check(first), SessionCheck::Ok);
+  EXPECT_EQ(Check(second), SessionCheck::Ok);
+  EXPECT_EQ(Check(third), SessionCheck::Ok);
+  // An administrator's login still gets in, pushing out the oldest.
+  mClock.Advance(1s);
+  EXPECT_EQ(Check(second), SessionCheck::Ok);
+  EXPECT_EQ(Check(third), SessionCheck::Ok);
+  Open("d", "admin");
+  EXPECT_EQ(Check(first), SessionCheck::NoSession);
+}
+
 TEST_F(HostSession, LogLinesNameTheAccountOnly) {
   zark::test::ClearLogs();
   NewSession session = Open("admin", "admin");

@@ -4,6 +4,7 @@
 
 #include <sys/stat.h>
 
+#include <climits>
 #include <cstring>
 
 namespace zark::ops {
@@ -497,7 +498,18 @@ INSTANTIATE_TEST_SUITE_P(
         ApplyCase{"add", "del", 0}, ApplyCase{"", "del", 0},
         // Several lines: the last one counts.
         ApplyCase{"del=1/2\ndel=2/2\nadd=1/2\n", "add", 75},
-        ApplyCase{"add=1/2\n\n", "del", 0}));
+        ApplyCase{"add=1/2\n\n", "del", 0},
+        // Counts the library never writes follow the same formula:
+        // negative counts give negative percentages, truncated toward zero.
+        ApplyCase{"del=-3/6", "del", -25}, ApplyCase{"add=-3/6", "add", 25},
+        ApplyCase{"add=-9/6", "add", -25}, ApplyCase{"del=-1/3", "del", -16},
+        ApplyCase{"del=3/-6", "del", -25}, ApplyCase{"del=-6/-6", "del", 50},
+        ApplyCase{"add=-1/0", "add", 50},
+        // Counts beyond any int: capped at 100 above, the lowest int below.
+        ApplyCase{"add=99999999999999999999/1", "add", 100},
+        ApplyCase{"del=-9223372036854775808/1", "del", INT_MIN},
+        ApplyCase{"del=99999999999999999999/-1", "del", INT_MIN},
+        ApplyCase{"del=-99999999999999999999/3", "del", INT_MIN}));
 
 TEST_F(ModuleOpsRulesSave, ApplyStatusLineLongerThanBufferUsesLastPiece) {
   // A line longer than the 128-byte buffer is taken in pieces of 127
@@ -541,6 +553,18 @@ TEST_F(ModuleOpsSaveStatus, RunningTaskTakesStageAndPercentageFromFile) {
   EXPECT_EQ(
       ParseJson(
           R"({"stage": "add", "status": "processing", "percentage": 75})"),
+      out);
+}
+
+TEST_F(ModuleOpsSaveStatus, NegativeCountInTheFileGivesANegativePercentage) {
+  zark::test::WriteFile("/tmp/pfProgress", "del=-3/6\n");
+  Json::Value out;
+  ASSERT_TRUE(pf->StartPortForwardingStatus(
+      out,
+      TaskRecord(ParseJson(R"({"status": "processing", "percentage": 5})"))));
+  EXPECT_EQ(
+      ParseJson(
+          R"({"stage": "del", "status": "processing", "percentage": -25})"),
       out);
 }
 

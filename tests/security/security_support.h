@@ -156,6 +156,8 @@ public:
   int Stop();
 
   [[nodiscard]] pid_t Pid() const { return mPid; }
+  // The port it listens on (127.0.0.1), once started.
+  [[nodiscard]] int Port() const { return mPort; }
   [[nodiscard]] SyslogSink &Log() { return mSink; }
   // The host's syslog lines and its standard output and error.
   [[nodiscard]] std::vector<std::string> LogLines() const;

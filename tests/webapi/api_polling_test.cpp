@@ -543,15 +543,16 @@ TEST_F(WebAPIPolling, SweepByFullIdRemovesOnlyThatTask) {
 
 // Bound and nesting
 
-TEST_F(WebAPIPolling, StartFailsWhenTheRegistryIsFull) {
+TEST_F(WebAPIPolling, StartFailsWhenTheRegistryIsFullOfRunningTasks) {
+  Gate release;
+  auto waitForRelease = [&release](APIRequest *, APIResponse *) {
+    release.Wait();
+  };
   std::vector<std::string> ids;
   for (std::size_t i = 0; i < APIPolling::kMaxTasks; ++i) {
-    APIPolling polling;
-    polling.SetGroupAttr("admin");
-    polling.SetPrefixAttr("T.bound");
-    APIResponse response;
-    ASSERT_TRUE(polling.Start(&response, DoNothing, nullptr)) << i;
-    ids.push_back(response.GetData()["task_id"].asString());
+    std::string id = StartTask(waitForRelease, "T.bound");
+    ASSERT_FALSE(id.empty()) << i;
+    ids.push_back(id);
   }
   zark::test::ClearLogs();
   APIPolling polling;
@@ -560,14 +561,75 @@ TEST_F(WebAPIPolling, StartFailsWhenTheRegistryIsFull) {
   APIResponse response;
   EXPECT_FALSE(polling.Start(&response, DoNothing, nullptr));
   EXPECT_EQ(response.GetErrorCode(), ZARK::WEBAPI_ERR_TASK_START);
+  EXPECT_EQ(response.GetErrorData()["reason"].asString(),
+            "too many tasks running");
+  EXPECT_EQ(response.GetErrorData()["max"].asUInt64(), APIPolling::kMaxTasks);
   EXPECT_TRUE(zark::test::HasLogContaining("T.bound not started"));
 
-  // Dropping one record makes room for one task.
+  // Dropping one record of a running task does not make room: the task
+  // still runs.
   ASSERT_TRUE(polling.Stop(ids.front(), true));
+  APIResponse stillFull;
+  EXPECT_FALSE(polling.Start(&stillFull, DoNothing, nullptr));
+
+  // Once the tasks end, the registry makes room by itself.
+  release.Open();
+  APIPolling::JoinAll();
   APIResponse again;
   EXPECT_TRUE(polling.Start(&again, DoNothing, nullptr));
-  APIResponse full;
-  EXPECT_FALSE(polling.Start(&full, DoNothing, nullptr));
+}
+
+TEST_F(WebAPIPolling, FinishedTasksNobodyPolledNeverFillTheRegistry) {
+  // Every browser tab closed in the middle of a job leaves a finished task
+  // that nobody polls.
+  std::vector<std::string> ids;
+  for (std::size_t i = 0; i < APIPolling::kMaxTasks + 200; ++i) {
+    APIPolling polling;
+    polling.SetGroupAttr("admin");
+    polling.SetPrefixAttr("T.unpolled");
+    APIResponse response;
+    ASSERT_TRUE(polling.Start(&response, DoNothing, nullptr))
+        << i << ": " << response.GetErrorData();
+    ids.push_back(response.GetData()["task_id"].asString());
+    if (i + 1 == APIPolling::kMaxTasks) {
+      APIPolling::JoinAll(); // every one of them has finished
+    }
+  }
+  APIPolling::JoinAll();
+  // The newest records are still there for their pollers; the oldest made
+  // room.
+  Json::Value record;
+  EXPECT_TRUE(APIPolling().Status(ids.back(), record));
+  EXPECT_TRUE(record["finish"].asBool());
+  EXPECT_FALSE(APIPolling().Status(ids.front(), record));
+}
+
+TEST_F(WebAPIPolling,
+       FinishedRecordsNobodyAsksForAreDroppedAfterTheirLifetime) {
+  struct LifetimeForThisTest {
+    LifetimeForThisTest() {
+      APIPolling::SetFinishedRecordLifetime(std::chrono::milliseconds(1000));
+    }
+    ~LifetimeForThisTest() {
+      APIPolling::SetFinishedRecordLifetime(
+          APIPolling::kDefaultFinishedRecordLifetime);
+    }
+  } lifetime;
+  const std::string asked = StartTask([](APIRequest *, APIResponse *) {});
+  const std::string forgotten = StartTask([](APIRequest *, APIResponse *) {});
+  APIPolling::JoinAll();
+  Json::Value record;
+  // Asking keeps a record: each Status starts its lifetime again.
+  for (int i = 0; i < 8; ++i) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    EXPECT_TRUE(APIPolling().Status(asked, record)) << i;
+  }
+  EXPECT_FALSE(APIPolling().Status(forgotten, record));
+  Json::Value lists;
+  ASSERT_TRUE(APIPolling().List("T.task", Strings({"admin"}), lists));
+  EXPECT_EQ(lists["admin"], Strings({asked}));
+  std::this_thread::sleep_for(std::chrono::milliseconds(1200));
+  EXPECT_FALSE(APIPolling().Status(asked, record));
 }
 
 TEST_F(WebAPIPolling, TaskCanStartAndPollAnotherTask) {

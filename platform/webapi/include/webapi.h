@@ -9,6 +9,7 @@
 
 #include <json/json.h>
 
+#include <chrono>
 #include <cstddef>
 #include <memory>
 #include <string>
@@ -133,12 +134,24 @@ public:
   // is dropped and its callback has returned.
   static constexpr std::size_t kMaxTasks = 1024;
 
+  // The record of a finished task is kept until it is dropped (Stop with
+  // remove, or SetRemoveAttr(true)) or until nobody asked for it with
+  // Status for this long since it finished or was last asked for: a browser
+  // tab closed in the middle of a job leaves no record behind for good.
+  static constexpr std::chrono::milliseconds kDefaultFinishedRecordLifetime =
+      std::chrono::minutes(10);
+  // Changes that time for the whole process (hosts and tests).
+  static void SetFinishedRecordLifetime(std::chrono::milliseconds lifetime);
+
   // Starts callback(copy of the request, task response, argument) on a new
   // thread and answers response with {"task_id": id}. Without SetRequest the
   // callback gets an empty request; it never gets null pointers. Returns
   // false (and answers WEBAPI_ERR_TASK_START with errors {"reason": text})
   // when no prefix or no callback was set, kMaxTasks tasks are held already
-  // or no thread could be started; false without an answer when response is
+  // and all of them still running ({"reason": "too many tasks running",
+  // "max": kMaxTasks}), or no thread could be started. When kMaxTasks are
+  // held and some have finished, the record of the one that finished first
+  // is dropped to make room; false without an answer when response is
   // null. A callback that throws ends its task with the error record
   // {"code": WEBAPI_ERR_TASK_EXCEPTION, "errors": {"reason": what()}}.
   bool Start(APIResponse *response, APIPollingCallback callback,

@@ -63,12 +63,21 @@ bool APIPolling::Start(APIResponse *response, APIPollingCallback callback,
   }
   TaskRegistry &registry = TaskRegistry::Instance();
   registry.JoinEnded();
+  bool full = false;
   const std::string taskId = registry.Start({.group = mGroup,
                                              .prefix = mPrefix,
                                              .removeWhenEnded = mRemove,
                                              .request = mRequest,
                                              .callback = callback,
-                                             .argument = argument});
+                                             .argument = argument},
+                                            full);
+  if (full) {
+    Json::Value errors(Json::objectValue);
+    errors["reason"] = "too many tasks running";
+    errors["max"] = static_cast<Json::UInt64>(kMaxTasks);
+    response->SetError(WEBAPI_ERR_TASK_START, errors);
+    return false;
+  }
   if (taskId.empty()) {
     // The registry logged why.
     AnswerStartFailure(*response, "task could not be started");
@@ -102,6 +111,10 @@ bool APIPolling::Stop(const std::string &taskId, bool remove) {
 bool APIPolling::IsStopRequested(const APIResponse *response) {
   return response != nullptr &&
          TaskRegistry::Instance().IsStopRequested(response);
+}
+
+void APIPolling::SetFinishedRecordLifetime(std::chrono::milliseconds lifetime) {
+  TaskRegistry::Instance().SetFinishedRecordLifetime(lifetime);
 }
 
 void APIPolling::JoinAll() {

@@ -42,6 +42,8 @@ struct TaskRegistry::Task {
   bool ended = false;
   // True once the callback has answered for the first time, or returned.
   bool reported = false;
+  // When the task finished, or a Status after that asked for it last.
+  std::chrono::steady_clock::time_point lastAsked;
 };
 
 // Keeps a task's record in step with the answers its callback sets on the
@@ -130,6 +132,37 @@ void TaskRegistry::UnlistLocked(Task &task) {
   mListed.erase(task.seq);
 }
 
+void TaskRegistry::ReapLocked(bool makeRoom) {
+  const auto now = std::chrono::steady_clock::now();
+  Task *firstFinished = nullptr;
+  for (auto it = mListed.begin(); it != mListed.end();) {
+    Task &task = *(it++)->second;
+    if (!task.ended) {
+      continue;
+    }
+    if (now - task.lastAsked >= mFinishedRecordLifetime) {
+      syslog(LOG_NOTICE, "%s:%d task %s dropped: finished and not asked for",
+             __FILE__, __LINE__, task.id.c_str());
+      UnlistLocked(task);
+    } else if (firstFinished == nullptr ||
+               task.lastAsked < firstFinished->lastAsked) {
+      firstFinished = &task;
+    }
+  }
+  if (makeRoom && firstFinished != nullptr &&
+      LiveCountLocked() >= kMaxLiveTasks) {
+    syslog(LOG_NOTICE, "%s:%d task %s dropped: finished, and %zu tasks held",
+           __FILE__, __LINE__, firstFinished->id.c_str(), kMaxLiveTasks);
+    UnlistLocked(*firstFinished);
+  }
+}
+
+void TaskRegistry::SetFinishedRecordLifetime(
+    std::chrono::milliseconds lifetime) {
+  std::lock_guard lock(mMutex);
+  mFinishedRecordLifetime = lifetime;
+}
+
 TaskRegistry::Task *
 TaskRegistry::FindListedLocked(const std::string &taskId) const {
   const auto seq = mSeqById.find(taskId);
@@ -139,7 +172,8 @@ TaskRegistry::FindListedLocked(const std::string &taskId) const {
   return mListed.at(seq->second).get();
 }
 
-std::string TaskRegistry::Start(const TaskSpec &spec) {
+std::string TaskRegistry::Start(const TaskSpec &spec, bool &full) {
+  full = false;
   auto task = std::make_shared<Task>();
   task->group = spec.group;
   task->removeWhenEnded = spec.removeWhenEnded;
@@ -150,9 +184,12 @@ std::string TaskRegistry::Start(const TaskSpec &spec) {
   task->response->SetListener(std::make_shared<RecordWriter>(*this, *task));
 
   std::lock_guard lock(mMutex);
+  ReapLocked(true);
   if (LiveCountLocked() >= kMaxLiveTasks) {
-    syslog(LOG_ERR, "%s:%d task %s not started: %zu tasks already held",
+    syslog(LOG_ERR,
+           "%s:%d task %s not started: %zu tasks already held, all running",
            __FILE__, __LINE__, spec.prefix.c_str(), kMaxLiveTasks);
+    full = true;
     return {};
   }
   task->id = NewIdLocked(spec.prefix);
@@ -242,6 +279,7 @@ void TaskRegistry::Finish(Task &task) {
     syslog(LOG_ERR, "%s:%d task %s: end not recorded: %s", __FILE__, __LINE__,
            task.id.c_str(), e.what());
   }
+  task.lastAsked = std::chrono::steady_clock::now();
   if (task.removeWhenEnded) {
     UnlistLocked(task);
   }
@@ -254,7 +292,8 @@ void TaskRegistry::Finish(Task &task) {
 
 bool TaskRegistry::Status(const std::string &taskId, Json::Value &record) {
   std::unique_lock lock(mMutex);
-  const Task *task = FindListedLocked(taskId);
+  ReapLocked(false);
+  Task *task = FindListedLocked(taskId);
   if (task == nullptr) {
     return false;
   }
@@ -271,6 +310,9 @@ bool TaskRegistry::Status(const std::string &taskId, Json::Value &record) {
     if (task == nullptr) {
       return false;
     }
+  }
+  if (task->ended) {
+    task->lastAsked = std::chrono::steady_clock::now();
   }
   record = task->record;
   return true;
@@ -296,6 +338,7 @@ bool TaskRegistry::List(const std::string &prefix, const Json::Value &groups,
   }
   {
     std::lock_guard lock(mMutex);
+    ReapLocked(false);
     for (const auto &[seq, task] : mListed) {
       if (wanted.contains(task->group) &&
           TaskIdMatchesPrefix(task->id, prefix)) {

@@ -27,6 +27,11 @@ namespace ZARK::webapi_internal {
 // record is dropped and its callback has returned. Start fails beyond it.
 inline constexpr std::size_t kMaxLiveTasks = APIPolling::kMaxTasks;
 
+// How long the record of a finished task is kept while nobody asks for it
+// (Status) before it is dropped, by default; see APIPolling.
+inline constexpr std::chrono::milliseconds kDefaultFinishedRecordLifetime =
+    APIPolling::kDefaultFinishedRecordLifetime;
+
 // How long Status waits for a task's first answer when its callback has not
 // answered yet (a poll that comes before the task's thread has run).
 inline constexpr std::chrono::milliseconds kFirstReportWait{2000};
@@ -57,9 +62,9 @@ public:
   ~TaskRegistry();
 
   // Creates the task's record and starts its thread. Returns the new id, or
-  // an empty string (after logging why) when the registry is full or no
-  // thread could be started.
-  [[nodiscard]] std::string Start(const TaskSpec &spec);
+  // an empty string (after logging why) when the registry is full of
+  // running tasks (full is then true) or no thread could be started.
+  [[nodiscard]] std::string Start(const TaskSpec &spec, bool &full);
 
   // The operations of APIPolling of the same names.
   [[nodiscard]] bool Status(const std::string &taskId, Json::Value &record);
@@ -67,6 +72,9 @@ public:
                           Json::Value &result);
   [[nodiscard]] bool Stop(const std::string &taskId, bool remove);
   [[nodiscard]] bool IsStopRequested(const APIResponse *response);
+
+  // See APIPolling::SetFinishedRecordLifetime.
+  void SetFinishedRecordLifetime(std::chrono::milliseconds lifetime);
 
   // Joins the threads of tasks whose callback has returned. Never waits for
   // a task that is still running.
@@ -98,6 +106,10 @@ private:
   std::size_t LiveCountLocked() const;
   // Drops the record from Status and List; may destroy task.
   void UnlistLocked(Task &task);
+  // Drops the records of finished tasks nobody asked for within the
+  // lifetime; with makeRoom, when no room is left, the record of the task
+  // that finished first as well. Logs what it drops.
+  void ReapLocked(bool makeRoom);
   Task *FindListedLocked(const std::string &taskId) const;
 
   // Joins the given threads with mJoinsInFlight counted, lock not held.
@@ -109,6 +121,8 @@ private:
   std::condition_variable mFirstReport;
   std::mt19937_64 mRandom;
   std::uint64_t mNextSeq = 0;
+  std::chrono::milliseconds mFinishedRecordLifetime =
+      kDefaultFinishedRecordLifetime;
   // Records that Status and List see, in start order (key: start sequence).
   std::map<std::uint64_t, std::shared_ptr<Task>> mListed;
   std::unordered_map<std::string, std::uint64_t> mSeqById;
