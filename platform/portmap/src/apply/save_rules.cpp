@@ -77,6 +77,17 @@ public:
   int Run(std::span<const ZARK_ROUTER_RULE> rules, ApplySummary &summary);
 
 private:
+  // Checks the gateway and the rules and picks the router; false (the
+  // result set) when the set is refused or no router is configured.
+  [[nodiscard]] bool PlanRules(std::span<const ZARK_ROUTER_RULE> rules,
+                               std::vector<WantedMapping> &wanted);
+  // Writes the rule configuration (unless the options say not to).
+  [[nodiscard]] bool StoreRules(std::span<const ZARK_ROUTER_RULE> rules);
+  // Reads the mapping state and picks this gateway's record.
+  void LoadState();
+  // The router work of a job with anything to delete, add or check.
+  void ApplyToRouter(int addTotal);
+
   // Records the first failure of the job (its type and text go to the
   // result) and logs every one.
   void Fail(uint32_t type, const std::string &message,
@@ -871,21 +882,17 @@ void Applier::RecordLastJob() {
   Record().lastJob = job;
 }
 
-int Applier::Run(std::span<const ZARK_ROUTER_RULE> rules,
-                 ApplySummary &summary) {
-  mSummary = &summary;
-  mResult = ZARK_ROUTER_SAVE_RULE_RESULT{};
-
+bool Applier::PlanRules(std::span<const ZARK_ROUTER_RULE> rules,
+                        std::vector<WantedMapping> &wanted) {
   std::optional<std::string> canonical = CanonicalGatewayAddress(mGateway);
   if (!canonical) {
     Fail(kSaveErrBadParameter,
          "\"" + mGateway + "\" is not an IPv4 gateway address");
-    return -1;
+    return false;
   }
   mGateway = *canonical;
 
   // The rule texts first: nothing else is looked at for a refused set.
-  std::vector<WantedMapping> wanted;
   RuleRefusal refusal = PlanWantedMappings(rules, INT_MAX, wanted);
   RouterChoice choice;
   if (refusal.errType == ZARK_SAVE_ERR_NONE) {
@@ -899,7 +906,7 @@ int Applier::Run(std::span<const ZARK_ROUTER_RULE> rules,
         Fail(err == ZARK_PORTMAP_ERR_IO ? kSaveErrIo : kSaveErrGeneric,
              "cannot read the router configuration of " + mGateway);
       }
-      return -1;
+      return false;
     }
     refusal = PlanWantedMappings(rules, choice.maxRouterEntries, wanted);
   }
@@ -913,10 +920,13 @@ int Applier::Run(std::span<const ZARK_ROUTER_RULE> rules,
       mResult.detail.limit.maxPort = refusal.maxPort;
       mResult.detail.limit.maxRange = refusal.maxRange;
     }
-    return -1;
+    return false;
   }
   mProtocol = choice.protocol;
+  return true;
+}
 
+bool Applier::StoreRules(std::span<const ZARK_ROUTER_RULE> rules) {
   // The rule configuration, written before the router is touched: a rule
   // set that passed the checks is never lost to a router that fails.
   RouterRuleConfWriter writer;
@@ -928,12 +938,81 @@ int Applier::Run(std::span<const ZARK_ROUTER_RULE> rules,
                         std::string(Field(rule.serviceid)),
                         std::string(Field(rule.service_name)))) {
       Fail(kSaveErrBadParameter, "a rule text does not fit the rule store");
-      return -1;
+      return false;
     }
   }
   if (mOptions.writeRuleConf && !writer.Sync(mEnv.ruleConfPath)) {
     Fail(kSaveErrIo, mEnv.ruleConfPath + " cannot be written",
          ZARK_FAILURE_LOCAL);
+    return false;
+  }
+  return true;
+}
+
+void Applier::LoadState() {
+  if (!LoadMappingState(mEnv.statePath, mState)) {
+    ZARK_PM_LOG_ERROR("the mappings made before are unknown; starting from "
+                      "none");
+  }
+  mState.FindOrAdd(mGateway, mProtocol);
+  for (std::size_t i = 0; i < mState.routers.size(); ++i) {
+    if (mState.routers[i].gateway == mGateway &&
+        mState.routers[i].protocol == mProtocol) {
+      mRecordIndex = i;
+    }
+  }
+}
+
+void Applier::ApplyToRouter(int addTotal) {
+  MarkBeforeTouching();
+  if (!SaveState()) {
+    return;
+  }
+  std::unique_ptr<RouterDriver> router =
+      mEnv.makeRouter(mProtocol, mGateway, &Record());
+  mRouter = router.get();
+  if (router == nullptr) {
+    Fail(kSaveErrGeneric, "no driver for protocol " +
+                              std::string(RouterProtocolName(mProtocol)));
+    PutBackUnattempted();
+    (void)SaveMappingState(mEnv.statePath, mState);
+    return;
+  }
+  RunDeletions(*router);
+  RunStaleDeletions();
+  if (!mDeletions.empty() || mStaleTotal > 0) {
+    (void)SaveMappingState(mEnv.statePath, mState);
+    mLastStateSave = Clock::now();
+  }
+  mProgress.Report("add", 0, addTotal);
+  RunAdditions(*router);
+  if (!mAborted && (mOptions.askExternalAddress || mSummary->failed > 0)) {
+    LearnExternalAddress(*router);
+  }
+  PutBackUnattempted();
+  std::string location = router->Location();
+  if (!location.empty()) {
+    Record().location = location;
+    Record().finiteLeases = router->FiniteLeases();
+    Record().controlUrl = router->ControlUrl();
+    Record().serviceType = router->ServiceType();
+  }
+  RecordLastJob();
+  mRouter = nullptr;
+  mState.DropEmpty();
+  if (!SaveMappingState(mEnv.statePath, mState)) {
+    Fail(kSaveErrIo,
+         "cannot record the router's mappings in " + mEnv.statePath);
+  }
+}
+
+int Applier::Run(std::span<const ZARK_ROUTER_RULE> rules,
+                 ApplySummary &summary) {
+  mSummary = &summary;
+  mResult = ZARK_ROUTER_SAVE_RULE_RESULT{};
+
+  std::vector<WantedMapping> wanted;
+  if (!PlanRules(rules, wanted) || !StoreRules(rules)) {
     return -1;
   }
 
@@ -946,18 +1025,7 @@ int Applier::Run(std::span<const ZARK_ROUTER_RULE> rules,
   mClient = *client;
 
   RunningTaskMark mark(ZARK_PORTMAP_TASK_APPLY_RULES, mEnv.runningTaskPath);
-
-  if (!LoadMappingState(mEnv.statePath, mState)) {
-    ZARK_PM_LOG_ERROR("the mappings made before are unknown; starting from "
-                      "none");
-  }
-  mState.FindOrAdd(mGateway, mProtocol);
-  for (std::size_t i = 0; i < mState.routers.size(); ++i) {
-    if (mState.routers[i].gateway == mGateway &&
-        mState.routers[i].protocol == mProtocol) {
-      mRecordIndex = i;
-    }
-  }
+  LoadState();
   Plan(wanted);
 
   const int deleteTotal = static_cast<int>(mDeletions.size()) + mStaleTotal;
@@ -970,46 +1038,7 @@ int Applier::Run(std::span<const ZARK_ROUTER_RULE> rules,
          mGateway.c_str(), deleteTotal, addTotal, summary.unchanged);
 
   if (deleteTotal + addTotal > 0) {
-    MarkBeforeTouching();
-    if (!SaveState()) {
-      return -1;
-    }
-    std::unique_ptr<RouterDriver> router =
-        mEnv.makeRouter(mProtocol, mGateway, &Record());
-    mRouter = router.get();
-    if (router == nullptr) {
-      Fail(kSaveErrGeneric, "no driver for protocol " +
-                                std::string(RouterProtocolName(mProtocol)));
-      PutBackUnattempted();
-      (void)SaveMappingState(mEnv.statePath, mState);
-      return -1;
-    }
-    RunDeletions(*router);
-    RunStaleDeletions();
-    if (!mDeletions.empty() || mStaleTotal > 0) {
-      (void)SaveMappingState(mEnv.statePath, mState);
-      mLastStateSave = Clock::now();
-    }
-    mProgress.Report("add", 0, addTotal);
-    RunAdditions(*router);
-    if (!mAborted && (mOptions.askExternalAddress || mSummary->failed > 0)) {
-      LearnExternalAddress(*router);
-    }
-    PutBackUnattempted();
-    std::string location = router->Location();
-    if (!location.empty()) {
-      Record().location = location;
-      Record().finiteLeases = router->FiniteLeases();
-      Record().controlUrl = router->ControlUrl();
-      Record().serviceType = router->ServiceType();
-    }
-    RecordLastJob();
-    mRouter = nullptr;
-    mState.DropEmpty();
-    if (!SaveMappingState(mEnv.statePath, mState)) {
-      Fail(kSaveErrIo,
-           "cannot record the router's mappings in " + mEnv.statePath);
-    }
+    ApplyToRouter(addTotal);
   } else {
     mProgress.Report("add", 0, 0);
   }

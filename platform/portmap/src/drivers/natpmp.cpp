@@ -88,6 +88,58 @@ struct NatPmpRouter::Session {
     }
   }
 
+  // What waiting for one reply gave.
+  enum class Wait { kAnswered, kTimedOut, kPollFailed };
+
+  // Waits until deadline for the reply of responseType. kAnswered: rc is
+  // libnatpmp's result (0: response holds the reply) and savedErrno the
+  // errno of a failed receive; kPollFailed: savedErrno is poll's.
+  Wait AwaitReply(Clock::time_point deadline, int responseType,
+                  natpmpresp_t &response, int &rc, int &savedErrno) {
+    for (;;) {
+      auto remaining = std::chrono::duration_cast<std::chrono::milliseconds>(
+          deadline - Clock::now());
+      if (remaining.count() <= 0) {
+        return Wait::kTimedOut;
+      }
+      pollfd watch{handle.s, POLLIN, 0};
+      int ready = ::poll(&watch, 1, static_cast<int>(remaining.count()) + 1);
+      if (ready < 0) {
+        if (errno == EINTR) {
+          continue;
+        }
+        savedErrno = errno;
+        return Wait::kPollFailed;
+      }
+      if (ready == 0) {
+        continue; // the loop head sees the deadline
+      }
+      rc = readnatpmpresponseorretry(&handle, &response);
+      savedErrno = rc == NATPMP_ERR_RECVFROM ? errno : 0;
+      if (rc == 0 && response.type != responseType) {
+        // A late reply to an earlier request: keep waiting for ours.
+        handle.has_pending_request = 1;
+        continue;
+      }
+      if (rc == NATPMP_TRYAGAIN || rc == NATPMP_ERR_WRONGPACKETSOURCE) {
+        continue;
+      }
+      return Wait::kAnswered;
+    }
+  }
+
+  // What a libnatpmp result that ended the wait means for the caller.
+  static RouterOutcome OutcomeOfAnswer(int rc) {
+    if (rc == 0) {
+      return RouterOutcome::kOk;
+    }
+    if (rc == NATPMP_ERR_NOGATEWAYSUPPORT) {
+      // The gateway answered "port unreachable": no NAT-PMP server.
+      return RouterOutcome::kNoAnswer;
+    }
+    return IsRouterError(rc) ? RouterOutcome::kRefused : RouterOutcome::kFailed;
+  }
+
   // Sends a request with send() and waits for the reply of responseType
   // on our own schedule. The reply is in response when the result is kOk.
   RouterResult Exchange(const NatPmpOptions &options, const char *call,
@@ -113,60 +165,32 @@ struct NatPmpRouter::Session {
       // that only this loop decides when to send.
       handle.retry_time.tv_sec += 3600;
 
-      const Clock::time_point deadline = Clock::now() + wait;
-      for (;;) {
-        auto remaining = std::chrono::duration_cast<std::chrono::milliseconds>(
-            deadline - Clock::now());
-        if (remaining.count() <= 0) {
-          break;
-        }
-        pollfd watch{handle.s, POLLIN, 0};
-        int ready = ::poll(&watch, 1, static_cast<int>(remaining.count()) + 1);
-        if (ready < 0) {
-          if (errno == EINTR) {
-            continue;
-          }
-          int savedErrno = errno;
-          LogRouterCall(__FILE__, __LINE__, "poll", ready, true, "poll failed",
-                        detail, savedErrno);
-          result.outcome = RouterOutcome::kFailed;
-          result.message = std::string(call) + " " + detail + ": poll failed";
-          return result;
-        }
-        if (ready == 0) {
-          continue; // the loop head sees the deadline
-        }
-        int rc = readnatpmpresponseorretry(&handle, &response);
-        if (rc == 0 && response.type != responseType) {
-          // A late reply to an earlier request: keep waiting for ours.
-          handle.has_pending_request = 1;
-          continue;
-        }
-        if (rc == NATPMP_TRYAGAIN || rc == NATPMP_ERR_WRONGPACKETSOURCE) {
-          continue;
-        }
-        int savedErrno = rc == NATPMP_ERR_RECVFROM ? errno : 0;
-        std::string tried = detail + " (try " + std::to_string(attempt) +
-                            " of " + std::to_string(options.tries) + ")";
-        LogRouterCall(__FILE__, __LINE__, call, rc, rc != 0,
-                      NatPmpResultMeaning(rc), tried, savedErrno);
-        result.code = rc;
-        result.message = std::string(call) + " " + detail + ": " +
-                         NatPmpResultMeaning(rc) + " (" + std::to_string(rc) +
-                         ")";
-        if (rc == 0) {
-          result.outcome = RouterOutcome::kOk;
-        } else if (rc == NATPMP_ERR_NOGATEWAYSUPPORT) {
-          // The gateway answered "port unreachable": no NAT-PMP server.
-          result.outcome = RouterOutcome::kNoAnswer;
-        } else if (IsRouterError(rc)) {
-          result.outcome = RouterOutcome::kRefused;
-        } else {
-          result.outcome = RouterOutcome::kFailed;
-        }
+      int rc = 0;
+      int savedErrno = 0;
+      switch (AwaitReply(Clock::now() + wait, responseType, response, rc,
+                         savedErrno)) {
+      case Wait::kTimedOut:
+        wait *= 2;
+        continue;
+      case Wait::kPollFailed:
+        LogRouterCall(__FILE__, __LINE__, "poll", -1, true, "poll failed",
+                      detail, savedErrno);
+        result.outcome = RouterOutcome::kFailed;
+        result.message = std::string(call) + " " + detail + ": poll failed";
         return result;
+      case Wait::kAnswered:
+        break;
       }
-      wait *= 2;
+      std::string tried = detail + " (try " + std::to_string(attempt) + " of " +
+                          std::to_string(options.tries) + ")";
+      LogRouterCall(__FILE__, __LINE__, call, rc, rc != 0,
+                    NatPmpResultMeaning(rc), tried, savedErrno);
+      result.code = rc;
+      result.message = std::string(call) + " " + detail + ": " +
+                       NatPmpResultMeaning(rc) + " (" + std::to_string(rc) +
+                       ")";
+      result.outcome = OutcomeOfAnswer(rc);
+      return result;
     }
     // Every wait ran out: the last word of libnatpmp was "try again".
     std::string tried =

@@ -175,60 +175,36 @@ UpnpRouter::UpnpRouter(UpnpOptions options)
 
 UpnpRouter::~UpnpRouter() = default;
 
-RouterResult UpnpRouter::Open() {
-  if (mOpen) {
-    RouterResult ok;
-    ok.outcome = RouterOutcome::kOk;
-    return ok;
-  }
-  mNetworks =
-      mOptions.localNetworks ? *mOptions.localNetworks : InterfaceNetworks();
-  mGateway = ParseIpv4(mOptions.gateway);
-
+bool UpnpRouter::OpenFromMemo(RouterResult &remembered) {
   // Only a control point on the local network, as a fresh description's
   // would have to be (ServicesOnLocalNetwork): the state file is no proof.
-  if (!mMemoTried && !mOptions.knownControlUrl.empty() &&
+  const bool usable =
+      !mMemoTried && !mOptions.knownControlUrl.empty() &&
       !mOptions.knownServiceType.empty() &&
       !mOptions.knownRootDescUrls.empty() &&
       IsUrlOnLocalNetwork(mOptions.knownRootDescUrls.front(), mNetworks,
                           mGateway) &&
-      IsUrlOnLocalNetwork(mOptions.knownControlUrl, mNetworks, mGateway)) {
-    // The control point the last job used: no description fetch. A request
-    // that fails through it fetches the description again
-    // (ControlUrlWasStale).
-    mMemoTried = true;
-    mFromMemo = true;
-    mRootDescUrl = mOptions.knownRootDescUrls.front();
-    mControlUrl = mOptions.knownControlUrl;
-    mServiceType = mOptions.knownServiceType;
-    mOpen = true;
-    RouterResult remembered;
-    remembered.outcome = RouterOutcome::kOk;
-    remembered.message =
-        "using " + mServiceType + " at " + mControlUrl + " (remembered)";
-    return remembered;
-  }
+      IsUrlOnLocalNetwork(mOptions.knownControlUrl, mNetworks, mGateway);
   mMemoTried = true;
-
-  RouterResult last;
-  last.outcome = RouterOutcome::kNoRouter;
-  last.message = "no UPnP router found";
-  std::vector<std::string> tried;
-  for (const std::string &url : mOptions.knownRootDescUrls) {
-    if (url.empty() ||
-        std::find(tried.begin(), tried.end(), url) != tried.end()) {
-      continue;
-    }
-    tried.push_back(url);
-    last = TryRootDescription(url);
-    if (last.Ok()) {
-      return last;
-    }
+  if (!usable) {
+    return false;
   }
-  if (!mOptions.discover) {
-    return last;
-  }
+  // The control point the last job used: no description fetch. A request
+  // that fails through it fetches the description again
+  // (ControlUrlWasStale).
+  mFromMemo = true;
+  mRootDescUrl = mOptions.knownRootDescUrls.front();
+  mControlUrl = mOptions.knownControlUrl;
+  mServiceType = mOptions.knownServiceType;
+  mOpen = true;
+  remembered.outcome = RouterOutcome::kOk;
+  remembered.message =
+      "using " + mServiceType + " at " + mControlUrl + " (remembered)";
+  return true;
+}
 
+std::vector<std::string>
+UpnpRouter::DiscoverDescriptions(const std::vector<std::string> &tried) {
   // Search for IGD versions 1 and 2; a router may answer only its own.
   static const char *const kSearchTargets[] = {
       "urn:schemas-upnp-org:device:InternetGatewayDevice:1",
@@ -271,7 +247,43 @@ RouterResult UpnpRouter::Open() {
   if (candidates.size() > static_cast<std::size_t>(kMaxCandidates)) {
     candidates.resize(kMaxCandidates);
   }
-  for (const std::string &url : candidates) {
+  return candidates;
+}
+
+RouterResult UpnpRouter::Open() {
+  if (mOpen) {
+    RouterResult ok;
+    ok.outcome = RouterOutcome::kOk;
+    return ok;
+  }
+  mNetworks =
+      mOptions.localNetworks ? *mOptions.localNetworks : InterfaceNetworks();
+  mGateway = ParseIpv4(mOptions.gateway);
+
+  RouterResult remembered;
+  if (OpenFromMemo(remembered)) {
+    return remembered;
+  }
+
+  RouterResult last;
+  last.outcome = RouterOutcome::kNoRouter;
+  last.message = "no UPnP router found";
+  std::vector<std::string> tried;
+  for (const std::string &url : mOptions.knownRootDescUrls) {
+    if (url.empty() ||
+        std::find(tried.begin(), tried.end(), url) != tried.end()) {
+      continue;
+    }
+    tried.push_back(url);
+    last = TryRootDescription(url);
+    if (last.Ok()) {
+      return last;
+    }
+  }
+  if (!mOptions.discover) {
+    return last;
+  }
+  for (const std::string &url : DiscoverDescriptions(tried)) {
     last = TryRootDescription(url);
     if (last.Ok()) {
       return last;

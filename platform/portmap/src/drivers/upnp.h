@@ -124,6 +124,13 @@ public:
   static constexpr int kMaxCandidates = 8;
 
 private:
+  // Opens on the control point the last job used, when it is still on the
+  // local network: true with remembered set.
+  [[nodiscard]] bool OpenFromMemo(RouterResult &remembered);
+  // Root description URLs found by an SSDP search, not in tried: the
+  // gateway's own first, at most kMaxCandidates.
+  [[nodiscard]] std::vector<std::string>
+  DiscoverDescriptions(const std::vector<std::string> &tried);
   RouterResult TryRootDescription(const std::string &url);
   // AddPortMapping's request (a second try with the other kind of lease on
   // 725 or 402), without reading the mapping back.

@@ -163,6 +163,75 @@ int MaxRouterEntries(std::string_view maxRuleText) {
   return value > 0 ? value : kDefaultMaxRouterEntries;
 }
 
+namespace {
+
+// The ports of one rule, pairwise: router port i goes to local port i.
+struct RulePorts {
+  std::vector<IpProtocol> protocols;
+  std::string_view routerText;
+  std::vector<uint16_t> routerPorts;
+  std::vector<uint16_t> localPorts;
+};
+
+// Reads the protocol and port texts of rule into ports (an empty side takes
+// the other's text); a refusal when a text is bad or the sides differ.
+RuleRefusal ReadRulePorts(const ZARK_ROUTER_RULE &rule, RulePorts &ports) {
+  const std::string_view ruleId = Field(rule.rule_id);
+  const std::string_view protocolText = Field(rule.router_protocol);
+  std::string_view routerText = Field(rule.router_port);
+  std::string_view localText = Field(rule.ds_port);
+
+  std::optional<std::vector<IpProtocol>> protocols =
+      RuleProtocols(protocolText);
+  if (!protocols) {
+    RuleRefusal refusal =
+        Refuse(ZARK_SAVE_ERR_BAD_PROTOCOL,
+               "rule \"" + std::string(ruleId) + "\": unknown protocol \"" +
+                   std::string(protocolText) + "\"");
+    refusal.text = std::string(protocolText);
+    return refusal;
+  }
+  ports.protocols = std::move(*protocols);
+  if (klibc::Trim(routerText, klibc::kSpaceAndTab).empty()) {
+    routerText = localText;
+  }
+  if (klibc::Trim(localText, klibc::kSpaceAndTab).empty()) {
+    localText = routerText;
+  }
+  ports.routerText = routerText;
+  PortTextError error = ExpandPortText(routerText, ports.routerPorts);
+  if (error != PortTextError::kNone) {
+    return RefusePortText(error, routerText, ruleId);
+  }
+  error = ExpandPortText(localText, ports.localPorts);
+  if (error != PortTextError::kNone) {
+    return RefusePortText(error, localText, ruleId);
+  }
+  if (ports.routerPorts.size() > static_cast<std::size_t>(kMaxPortsPerRule) ||
+      ports.localPorts.size() > static_cast<std::size_t>(kMaxPortsPerRule)) {
+    RuleRefusal refusal =
+        Refuse(ZARK_SAVE_ERR_TOO_MANY_PORTS,
+               "rule \"" + std::string(ruleId) + "\": more than " +
+                   std::to_string(kMaxPortsPerRule) + " ports in one rule");
+    refusal.maxPort = kMaxPortsPerRule;
+    return refusal;
+  }
+  if (ports.routerPorts.size() != ports.localPorts.size()) {
+    RuleRefusal refusal =
+        Refuse(ZARK_SAVE_ERR_BAD_PORT_TEXT,
+               "rule \"" + std::string(ruleId) +
+                   "\": " + std::to_string(ports.routerPorts.size()) +
+                   " router port(s) \"" + std::string(routerText) + "\" but " +
+                   std::to_string(ports.localPorts.size()) +
+                   " local port(s) \"" + std::string(localText) + "\"");
+    refusal.text = std::string(localText);
+    return refusal;
+  }
+  return RuleRefusal{};
+}
+
+} // namespace
+
 RuleRefusal PlanWantedMappings(std::span<const ZARK_ROUTER_RULE> rules,
                                int maxRouterEntries,
                                std::vector<WantedMapping> &wanted) {
@@ -170,81 +239,36 @@ RuleRefusal PlanWantedMappings(std::span<const ZARK_ROUTER_RULE> rules,
   // (protocol, router port) -> index in wanted, to merge and to catch two
   // rules sending one router port to different local ports.
   std::map<std::pair<IpProtocol, uint16_t>, std::size_t> byRouterPort;
-  std::vector<uint16_t> routerPorts;
-  std::vector<uint16_t> localPorts;
+  RulePorts ports;
   for (const ZARK_ROUTER_RULE &rule : rules) {
     if (rule.enable == 0) {
       continue;
     }
+    RuleRefusal refusal = ReadRulePorts(rule, ports);
+    if (refusal.errType != ZARK_SAVE_ERR_NONE) {
+      return refusal;
+    }
     const std::string_view ruleId = Field(rule.rule_id);
-    const std::string_view protocolText = Field(rule.router_protocol);
-    std::string_view routerText = Field(rule.router_port);
-    std::string_view localText = Field(rule.ds_port);
-
-    std::optional<std::vector<IpProtocol>> protocols =
-        RuleProtocols(protocolText);
-    if (!protocols) {
-      RuleRefusal refusal =
-          Refuse(ZARK_SAVE_ERR_BAD_PROTOCOL,
-                 "rule \"" + std::string(ruleId) + "\": unknown protocol \"" +
-                     std::string(protocolText) + "\"");
-      refusal.text = std::string(protocolText);
-      return refusal;
-    }
-    if (klibc::Trim(routerText, klibc::kSpaceAndTab).empty()) {
-      routerText = localText;
-    }
-    if (klibc::Trim(localText, klibc::kSpaceAndTab).empty()) {
-      localText = routerText;
-    }
-    PortTextError error = ExpandPortText(routerText, routerPorts);
-    if (error != PortTextError::kNone) {
-      return RefusePortText(error, routerText, ruleId);
-    }
-    error = ExpandPortText(localText, localPorts);
-    if (error != PortTextError::kNone) {
-      return RefusePortText(error, localText, ruleId);
-    }
-    if (routerPorts.size() > static_cast<std::size_t>(kMaxPortsPerRule) ||
-        localPorts.size() > static_cast<std::size_t>(kMaxPortsPerRule)) {
-      RuleRefusal refusal =
-          Refuse(ZARK_SAVE_ERR_TOO_MANY_PORTS,
-                 "rule \"" + std::string(ruleId) + "\": more than " +
-                     std::to_string(kMaxPortsPerRule) + " ports in one rule");
-      refusal.maxPort = kMaxPortsPerRule;
-      return refusal;
-    }
-    if (routerPorts.size() != localPorts.size()) {
-      RuleRefusal refusal =
-          Refuse(ZARK_SAVE_ERR_BAD_PORT_TEXT,
-                 "rule \"" + std::string(ruleId) +
-                     "\": " + std::to_string(routerPorts.size()) +
-                     " router port(s) \"" + std::string(routerText) +
-                     "\" but " + std::to_string(localPorts.size()) +
-                     " local port(s) \"" + std::string(localText) + "\"");
-      refusal.text = std::string(localText);
-      return refusal;
-    }
-    for (IpProtocol protocol : *protocols) {
-      for (std::size_t i = 0; i < routerPorts.size(); ++i) {
-        auto key = std::make_pair(protocol, routerPorts[i]);
+    for (IpProtocol protocol : ports.protocols) {
+      for (std::size_t i = 0; i < ports.routerPorts.size(); ++i) {
+        auto key = std::make_pair(protocol, ports.routerPorts[i]);
         auto found = byRouterPort.find(key);
         if (found != byRouterPort.end()) {
           const WantedMapping &earlier = wanted[found->second];
-          if (earlier.internalPort == localPorts[i]) {
+          if (earlier.internalPort == ports.localPorts[i]) {
             continue; // the same mapping twice
           }
-          RuleRefusal refusal = Refuse(
+          RuleRefusal clash = Refuse(
               ZARK_SAVE_ERR_BAD_PORT_TEXT,
               "rules \"" + earlier.ruleId + "\" and \"" + std::string(ruleId) +
                   "\" both use router port " + ProtocolText(protocol) + " " +
-                  std::to_string(routerPorts[i]));
-          refusal.text = std::string(routerText);
-          return refusal;
+                  std::to_string(ports.routerPorts[i]));
+          clash.text = std::string(ports.routerText);
+          return clash;
         }
         byRouterPort.emplace(key, wanted.size());
-        wanted.push_back(
-            {protocol, routerPorts[i], localPorts[i], std::string(ruleId)});
+        wanted.push_back({protocol, ports.routerPorts[i], ports.localPorts[i],
+                          std::string(ruleId)});
       }
     }
   }
