@@ -1,5 +1,7 @@
 #include "host_options.h"
 
+#include "request_guard.h"
+
 #include <arpa/inet.h>
 #include <getopt.h>
 
@@ -113,6 +115,7 @@ enum : int {
   kSessionMax,
   kSecureCookie,
   kKeeperInterval,
+  kHostName,
 };
 
 const option kHostOptions[] = {
@@ -126,6 +129,7 @@ const option kHostOptions[] = {
     {"session-max", required_argument, nullptr, kSessionMax},
     {"secure-cookie", no_argument, nullptr, kSecureCookie},
     {"keeper-interval", required_argument, nullptr, kKeeperInterval},
+    {"host-name", required_argument, nullptr, kHostName},
     {nullptr, 0, nullptr, 0},
 };
 
@@ -199,6 +203,18 @@ bool ApplyHostOption(int got, const char *value, const std::string &name,
         static_cast<std::int32_t>(interval->count() / 1000);
     break;
   }
+  case kHostName:
+    // Names given add to the machine's own (a DNS name of the server, a
+    // reverse proxy's); an empty list means the machine's own only.
+    if (options.http.hostNames.empty()) {
+      options.http.hostNames = LocalHostNames();
+    }
+    if (value[0] == '\0') {
+      error = "--host-name takes a name";
+      return false;
+    }
+    options.http.hostNames.emplace_back(value);
+    break;
   default:
     break;
   }
@@ -206,7 +222,7 @@ bool ApplyHostOption(int got, const char *value, const std::string &name,
 }
 
 bool IsTableOption(int got) {
-  return got >= kListen && got <= kKeeperInterval;
+  return got >= kListen && got <= kHostName;
 }
 
 } // namespace
@@ -281,6 +297,10 @@ std::string HostUsage(std::string_view program) {
          "  --keeper-interval SECONDS  how often modules check the router "
          "for lost\n"
          "                         mappings, 1 to 86400 (default 300)\n"
+         "  --host-name NAME       also answer requests for this name "
+         "(repeatable;\n"
+         "                         default: addresses, localhost and the "
+         "machine's name)\n"
          "  --help                 this text\n"
          "\n"
          "passwd reads the password from standard input (twice, without "

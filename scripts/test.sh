@@ -46,7 +46,12 @@ trap stop_analysis EXIT
 if [ "$hardening" != 0 ]; then
   mkdir -p "$root/build-tidy"
   step "static analysis started in the background (log: $analysis_log)"
-  setsid nice -n 19 bash "$root/scripts/analyze.sh" >"$analysis_log" 2>&1 &
+  # A session of its own, so that it can be stopped as a whole; where the
+  # kernel groups processes by session for scheduling, that group gets the
+  # lowest weight too (otherwise it would share the processors equally).
+  setsid bash -c 'echo 19 >/proc/self/autogroup 2>/dev/null || true
+    exec nice -n 19 bash "$0"' "$root/scripts/analyze.sh" \
+    >"$analysis_log" 2>&1 &
   analysis_pid=$!
 fi
 

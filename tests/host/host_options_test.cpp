@@ -1,5 +1,6 @@
 // The host's command line.
 #include "host_options.h"
+#include "request_guard.h"
 
 #include <gtest/gtest.h>
 
@@ -53,6 +54,29 @@ TEST(HostOptions, EveryOptionTakesItsValue) {
   EXPECT_EQ(parsed.options.sessions.maxLifetime, 1h);
   EXPECT_TRUE(parsed.options.secureCookie);
   EXPECT_EQ(parsed.options.modules.keeper_interval_seconds, 5);
+}
+
+TEST(HostOptions, HostNamesAddToTheMachinesOwn) {
+  Parsed none = Parse({});
+  ASSERT_EQ(none.result, OptionsResult::Run);
+  EXPECT_TRUE(none.options.http.hostNames.empty());
+
+  Parsed parsed =
+      Parse({"--host-name", "nas.example.net", "--host-name=proxy"});
+  ASSERT_EQ(parsed.result, OptionsResult::Run) << parsed.error;
+  std::vector<std::string> expected = LocalHostNames();
+  expected.push_back("nas.example.net");
+  expected.push_back("proxy");
+  EXPECT_EQ(parsed.options.http.hostNames, expected);
+  EXPECT_TRUE(
+      IsAllowedHost("nas.example.net:5000", parsed.options.http.hostNames));
+  EXPECT_TRUE(IsAllowedHost("localhost:5000", parsed.options.http.hostNames));
+  EXPECT_FALSE(
+      IsAllowedHost("rebind.example.org", parsed.options.http.hostNames));
+
+  Parsed empty = Parse({"--host-name", ""});
+  EXPECT_EQ(empty.result, OptionsResult::Error);
+  EXPECT_EQ(empty.error, "--host-name takes a name");
 }
 
 TEST(HostOptions, BadValuesAreErrors) {
