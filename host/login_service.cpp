@@ -36,6 +36,13 @@ LoginOutcome LoginService::Login(std::string_view account,
     outcome.retryAfter = wait;
     return outcome;
   }
+  // The next attempt of this address goes on when this one has ended, on
+  // every path below.
+  struct EndAttempt {
+    LoginThrottle &throttle;
+    std::string_view address;
+    ~EndAttempt() { throttle.Release(address); }
+  } endAttempt{mThrottle, clientAddress};
 
   std::optional<std::vector<Account>> accounts = LoadAccounts(mAccountsFile);
   if (!accounts) {

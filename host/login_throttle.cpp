@@ -89,7 +89,12 @@ std::chrono::seconds LoginThrottle::Claim(std::string_view account,
                                           std::string_view address) {
   const std::string accountKey = AccountKey(account);
   const std::string addressKey = AddressKey(address);
-  std::lock_guard lock(mMutex);
+  std::unique_lock lock(mMutex);
+  // The wait is on the real clock: it bounds a thread, not a backoff.
+  if (!mTurnEnded.wait_for(lock, kTurnWait,
+                           [&] { return mUnderWay.count(addressKey) == 0; })) {
+    return std::chrono::seconds(1);
+  }
   const Clock::TimePoint now = mClock.Now();
   ForgetOldLocked(now);
   Clock::TimePoint::duration wait = WaitLocked(accountKey, addressKey, now);
@@ -99,7 +104,17 @@ std::chrono::seconds LoginThrottle::Claim(std::string_view account,
   }
   CountFailureLocked(accountKey, now);
   CountFailureLocked(addressKey, now);
+  mUnderWay.insert(addressKey);
   return std::chrono::seconds(0);
+}
+
+void LoginThrottle::Release(std::string_view address) {
+  const std::string addressKey = AddressKey(address);
+  {
+    std::lock_guard lock(mMutex);
+    mUnderWay.erase(addressKey);
+  }
+  mTurnEnded.notify_all();
 }
 
 void LoginThrottle::CountFailureLocked(const std::string &key,

@@ -12,17 +12,22 @@
 // the account.
 //
 // An attempt is claimed (counted as a failure) in the same step as the
-// check that lets it through, before the password is checked: concurrent
-// guesses cannot all slip in at the end of a wait.
+// check that lets it through, before the password is checked, and the
+// attempts of one address are checked one at a time: concurrent guesses
+// cannot all slip in at the end of a wait, and concurrent right passwords
+// from one address (several tabs, one office behind NAT) are served in
+// turn instead of being refused.
 #ifndef ZARK_HOST_LOGIN_THROTTLE_H
 #define ZARK_HOST_LOGIN_THROTTLE_H
 
 #include "clock.h"
 
 #include <chrono>
+#include <condition_variable>
 #include <cstddef>
 #include <map>
 #include <mutex>
+#include <set>
 #include <string>
 #include <string_view>
 
@@ -53,10 +58,18 @@ public:
                                                 std::string_view address);
 
   // One step: 0 when the attempt may go on, and then it is already counted
-  // as a failure of both (RecordSuccess undoes that); otherwise the wait
-  // RetryAfter would give, and nothing is counted.
+  // as a failure of both (RecordSuccess undoes that) and the address's
+  // attempt is under way until Release; otherwise the wait RetryAfter
+  // would give, and nothing is counted. Waits, at most kTurnWait, while
+  // another attempt of the same address is under way (then 1 s to wait).
   [[nodiscard]] std::chrono::seconds Claim(std::string_view account,
                                            std::string_view address);
+
+  // Ends the attempt of address that Claim let through.
+  void Release(std::string_view address);
+
+  // How long Claim waits for the address's attempt under way.
+  static constexpr std::chrono::seconds kTurnWait{15};
 
   // A failed login: both counters go up, and from the freeFailures-th
   // consecutive failure on both wait firstDelay * 2^(count - freeFailures),
@@ -81,7 +94,10 @@ private:
   const Clock &mClock;
   const ThrottlePolicy mPolicy;
   std::mutex mMutex;
+  std::condition_variable mTurnEnded;
   std::map<std::string, Entry, std::less<>> mEntries;
+  // Address keys with an attempt under way.
+  std::set<std::string, std::less<>> mUnderWay;
 };
 
 // The key an address is counted under: an IPv4 address as it is (also when

@@ -144,9 +144,10 @@ protected:
 TEST_F(FaultDiskFull, SaveThatChangesTheRouterFailsAndKeepsTheOldRules) {
   Json::Value rules = OldRules();
   rules.append(Rule("game", "udp", "15000", "5000"));
-  SaveFailsOnTheFullDiskThenSucceeds(
-      rules, "cannot record the router's mappings in " ZARK_PORTMAP_CONF_DIR
-             "/mappings.json");
+  // The rules are stored before the router is touched: the full disk stops
+  // the save there, and the router keeps the old mappings.
+  SaveFailsOnTheFullDiskThenSucceeds(rules, ZARK_PORTMAP_RULE_CONF
+                                     " cannot be written");
 }
 
 TEST_F(FaultDiskFull, SaveThatOnlyRewritesTheRulesFailsAndKeepsThem) {
@@ -154,9 +155,8 @@ TEST_F(FaultDiskFull, SaveThatOnlyRewritesTheRulesFailsAndKeepsThem) {
   Json::Value disabled = Rule("later", "tcp", "18443", "443");
   disabled["enable"] = false;
   rules.append(disabled);
-  SaveFailsOnTheFullDiskThenSucceeds(
-      rules, "the router holds the rules but " ZARK_PORTMAP_RULE_CONF
-             " cannot be written");
+  SaveFailsOnTheFullDiskThenSucceeds(rules, ZARK_PORTMAP_RULE_CONF
+                                     " cannot be written");
 }
 
 } // namespace

@@ -75,14 +75,17 @@ TEST_F(HostThrottle, StrangerCannotKeepACleanAddressOut) {
     std::chrono::seconds wait = Wait("admin", "192.0.2.66");
     mClock.Advance(wait);
     EXPECT_EQ(mThrottle.Claim("admin", "192.0.2.66"), 0s);
+    mThrottle.Release("192.0.2.66");
     EXPECT_EQ(mThrottle.Claim("admin", "10.0.0.1"), 0s) << "round " << round;
     mThrottle.RecordSuccess("admin", "10.0.0.1");
+    mThrottle.Release("10.0.0.1");
   }
 }
 
 TEST_F(HostThrottle, ClaimCountsTheAttemptBeforeItIsChecked) {
   Fail("admin", "10.0.0.1", 2);
   EXPECT_EQ(mThrottle.Claim("admin", "10.0.0.1"), 0s);
+  mThrottle.Release("10.0.0.1");
   // The claimed attempt is the third failure already.
   EXPECT_EQ(mThrottle.Claim("admin", "10.0.0.1"), 2s);
   EXPECT_EQ(Wait("admin", "10.0.0.1"), 2s);
@@ -99,6 +102,8 @@ TEST_F(HostThrottle, ConcurrentClaimsAtTheEndOfAWaitLetOneThrough) {
     guessers.emplace_back([this, &through] {
       if (mThrottle.Claim("admin", "10.0.0.1") == 0s) {
         ++through;
+        // A wrong password: the claim stays counted as the failure.
+        mThrottle.Release("10.0.0.1");
       }
     });
   }
@@ -106,6 +111,24 @@ TEST_F(HostThrottle, ConcurrentClaimsAtTheEndOfAWaitLetOneThrough) {
     guesser.join();
   }
   EXPECT_EQ(through.load(), 1);
+}
+
+TEST_F(HostThrottle, ConcurrentRightPasswordsOfOneAddressAreServedInTurn) {
+  std::atomic<int> through{0};
+  std::vector<std::thread> tabs;
+  for (int i = 0; i < 8; ++i) {
+    tabs.emplace_back([this, &through] {
+      if (mThrottle.Claim("admin", "10.0.0.1") == 0s) {
+        ++through;
+        mThrottle.RecordSuccess("admin", "10.0.0.1");
+        mThrottle.Release("10.0.0.1");
+      }
+    });
+  }
+  for (std::thread &tab : tabs) {
+    tab.join();
+  }
+  EXPECT_EQ(through.load(), 8);
 }
 
 TEST_F(HostThrottle, Ipv6AddressesCountByTheirSlash64) {

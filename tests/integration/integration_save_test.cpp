@@ -6,8 +6,12 @@
 // UPnP IGD, once by NAT-PMP.
 #include "integration_fixture.h"
 
+#include "zarkportforward.h"
+
 #include <algorithm>
+#include <map>
 #include <set>
+#include <sstream>
 #include <tuple>
 #include <vector>
 
@@ -16,9 +20,13 @@ namespace {
 
 using zark::test::HasLogContaining;
 using zark::testnet::EchoListener;
+using zark::testnet::FlushRouterMappings;
 using zark::testnet::ListUpnpMappings;
 using zark::testnet::ProbeFromOutside;
 using zark::testnet::Protocol;
+using zark::testnet::RunTool;
+using zark::testnet::StartRouterDaemon;
+using zark::testnet::StopRouterDaemon;
 using zark::testnet::UpnpMapping;
 
 using Wanted = std::tuple<std::string, int, int>; // protocol, outside, inside
@@ -154,7 +162,115 @@ protected:
     ASSERT_TRUE(loaded.success);
     EXPECT_EQ(Json::Value(Json::arrayValue), loaded.data);
   }
+
+  // The state of every mapping of the saved rules, as the library's status
+  // record gives it: "protocol port" -> state.
+  std::map<std::string, std::string> MappingStates() {
+    char *text = nullptr;
+    ZARK_LIBZARKPORTMAP_ERR err{};
+    EXPECT_EQ(0, KLibGetPortMapStatus(mNet.lanRouter.c_str(), &text, &err));
+    std::map<std::string, std::string> states;
+    if (text == nullptr) {
+      return states;
+    }
+    Json::Value status;
+    std::string why;
+    Json::CharReaderBuilder builder;
+    std::istringstream in(text);
+    EXPECT_TRUE(Json::parseFromStream(builder, in, &status, &why)) << why;
+    KLibFreeText(text);
+    for (const Json::Value &rule : status["rules"]) {
+      states[rule["protocol"].asString() + " " +
+             std::to_string(rule["external_port"].asInt())] =
+          rule["state"].asString();
+    }
+    return states;
+  }
+
+  // Every mapping of ThreeRules() in state.
+  static std::map<std::string, std::string>
+  AllThreeRulesIn(const std::string &state) {
+    std::map<std::string, std::string> states;
+    for (const auto &[protocol, outside, inside] : ThreeRulesMappings()) {
+      std::string lower = protocol == "TCP" ? "tcp" : "udp";
+      states[lower + " " + std::to_string(outside)] = state;
+    }
+    return states;
+  }
 };
+
+// Mappings deleted on the router behind the library's back (another
+// client's "upnpc -d"): saving the same rules again puts them back, since
+// a save asks the router instead of trusting what the library remembers.
+TEST_F(IntegrationSave, UnchangedSaveRestoresMappingsDeletedOnTheRouter) {
+  ConfigureRouter("UPnP IGD", "yes", "no");
+  Json::Value history(Json::arrayValue);
+  ASSERT_TRUE(Save(ThreeRules(), history)) << history.toStyledString();
+  ASSERT_EQ(ThreeRulesMappings(), RouterMappings());
+  for (const char *port : {"18080", "20005"}) {
+    std::string output;
+    ASSERT_EQ(
+        0, RunTool({"/usr/bin/upnpc", "-u", mNet.rootDesc, "-d", port, "TCP"},
+                   output))
+        << output;
+  }
+  std::set<Wanted> lacking = ThreeRulesMappings();
+  lacking.erase({"TCP", 18080, 8080});
+  lacking.erase({"TCP", 20005, 20005});
+  ASSERT_EQ(lacking, RouterMappings());
+
+  history = Json::Value(Json::arrayValue);
+  ASSERT_TRUE(Save(ThreeRules(), history)) << history.toStyledString();
+  EXPECT_EQ(ThreeRulesMappings(), RouterMappings());
+  EXPECT_EQ(AllThreeRulesIn("on_router"), MappingStates());
+}
+
+// The router restarted and lost every mapping: an unchanged save restores
+// them all.
+TEST_F(IntegrationSave, UnchangedSaveRestoresWhatARestartedRouterLost) {
+  ConfigureRouter("UPnP IGD", "yes", "no");
+  Json::Value history(Json::arrayValue);
+  ASSERT_TRUE(Save(ThreeRules(), history)) << history.toStyledString();
+  std::string why;
+  ASSERT_TRUE(StopRouterDaemon(mNet, false, &why)) << why;
+  ASSERT_TRUE(FlushRouterMappings(mNet, &why)) << why;
+  ASSERT_TRUE(StartRouterDaemon(mNet, false, &why)) << why;
+  ASSERT_TRUE(RouterMappings().empty());
+
+  history = Json::Value(Json::arrayValue);
+  ASSERT_TRUE(Save(ThreeRules(), history)) << history.toStyledString();
+  EXPECT_EQ(ThreeRulesMappings(), RouterMappings());
+}
+
+// A save while the router does not answer fails as before (the default
+// code), but the rules are kept and marked pending; once the router is
+// back, the keeper's round applies them without another save.
+TEST_F(IntegrationSave, RulesSavedWhileTheRouterIsDownAreAppliedLater) {
+  ConfigureRouter("UPnP IGD", "yes", "no");
+  std::string why;
+  ASSERT_TRUE(StopRouterDaemon(mNet, false, &why)) << why;
+  Json::Value history(Json::arrayValue);
+  EXPECT_FALSE(Save(ThreeRules(), history)) << history.toStyledString();
+  ASSERT_FALSE(history.empty());
+  EXPECT_EQ(1500, history[history.size() - 1]["code"].asInt())
+      << history.toStyledString();
+  Answer loaded = Invoke(kApiRules, "load");
+  ASSERT_TRUE(loaded.success) << loaded.errorCode;
+  EXPECT_EQ(ThreeRules(), loaded.data);
+  EXPECT_EQ(AllThreeRulesIn("pending"), MappingStates());
+
+  ASSERT_TRUE(StartRouterDaemon(mNet, false, &why)) << why;
+  ASSERT_GE(KLibZarkPortMapLock(), 0);
+  int next = 0;
+  ZARK_PORTMAP_APPLY_SUMMARY summary{};
+  ZARK_ROUTER_SAVE_RULE_RESULT result{};
+  const int kept =
+      KLibKeepRouter(mNet.lanRouter.c_str(), 300, &next, &summary, &result);
+  ASSERT_GE(KLibZarkPortMapUnLock(), 0);
+  EXPECT_EQ(0, kept) << result.detail.text;
+  EXPECT_EQ(ThreeRulesMappings(), RouterMappings());
+  EXPECT_EQ(AllThreeRulesIn("on_router"), MappingStates());
+}
 
 TEST_F(IntegrationSave, UpnpRouterHoldsExactlyTheSavedRules) {
   ConfigureRouter("UPnP IGD", "yes", "no");
