@@ -345,7 +345,8 @@ TEST_F(PortMapApplyRouterTruthIgd2, AnotherProgramsMappingOnThisServerIsKept) {
   }
   EXPECT_EQ(5u, mIgd.Table().size());
   EXPECT_EQ("other program", mIgd.Table()[0].description);
-  const RecordedMapping *ssh = Record().Find(IpProtocol::kTcp, 2222);
+  const RouterRecord record = Record();
+  const RecordedMapping *ssh = record.Find(IpProtocol::kTcp, 2222);
   ASSERT_NE(nullptr, ssh);
   EXPECT_EQ(MappingApply::kRefused, ssh->apply);
   EXPECT_EQ(ZARK_FAILURE_CONFLICT, ssh->failure);
@@ -359,7 +360,8 @@ TEST_F(PortMapApplyRouterTruthIgd2, TheConfirmingListingCatchesADroppedAdd) {
   EXPECT_EQ(3, mIgd.Count("AddPortMapping"));
   EXPECT_EQ(0, mIgd.Count("GetSpecificPortMappingEntry"));
   EXPECT_NE(nullptr, std::strstr(mResult.detail.text, "table is full"));
-  const RecordedMapping *third = Record().Find(IpProtocol::kTcp, 8003);
+  const RouterRecord record = Record();
+  const RecordedMapping *third = record.Find(IpProtocol::kTcp, 8003);
   ASSERT_NE(nullptr, third);
   EXPECT_EQ(MappingApply::kRefused, third->apply);
   EXPECT_EQ(ZARK_FAILURE_TABLE_FULL, third->failure);
