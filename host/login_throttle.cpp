@@ -20,7 +20,7 @@ std::string AddressKey(std::string_view address) {
 } // namespace
 
 std::string ThrottleAddressKey(std::string_view address) {
-  const std::string text(address);
+  std::string text(address);
   std::array<unsigned char, 16> bytes{};
   if (text.find(':') == std::string::npos ||
       inet_pton(AF_INET6, text.c_str(), bytes.data()) != 1) {
