@@ -270,8 +270,11 @@ extern "C" int KLibKeepRouter(const char *gatewayIP, int checkIntervalSeconds,
                               ZARK_PORTMAP_APPLY_SUMMARY *summary,
                               ZARK_ROUTER_SAVE_RULE_RESULT *result) {
   using namespace zark::portmap;
+  // Where the result goes when the caller does not want it.
   ZARK_ROUTER_SAVE_RULE_RESULT local{};
-  ZARK_ROUTER_SAVE_RULE_RESULT &out = result != nullptr ? *result : local;
+  ZARK_ROUTER_SAVE_RULE_RESULT *const picked =
+      result != nullptr ? result : &local;
+  ZARK_ROUTER_SAVE_RULE_RESULT &out = *picked;
   out = ZARK_ROUTER_SAVE_RULE_RESULT{};
   int next = std::max(checkIntervalSeconds, 1);
   if (nextSeconds != nullptr) {
