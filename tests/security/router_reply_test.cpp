@@ -152,7 +152,8 @@ TEST_F(SecurityRouterReplies, UrlBaseOffTheNetworkIsRefusedBeforeAnyRequest) {
       "refusing control URL " + Elsewhere("/ctl/IPConn") +
       " of the UPnP device at " + mIgd->Url("/rootDesc.xml") + ": host " +
       mNet.wanOutside + " is not on the local network"));
-  EXPECT_EQ(std::vector<std::string>{"GET /rootDesc.xml"}, mIgd->RequestLines());
+  EXPECT_EQ(std::vector<std::string>{"GET /rootDesc.xml"},
+            mIgd->RequestLines());
   // The router failed, not the rules: they are kept for the next try.
   EXPECT_TRUE(std::filesystem::exists(ZARK_PORTMAP_RULE_CONF));
   ExpectNothingWentElsewhere();

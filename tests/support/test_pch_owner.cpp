@@ -1,2 +1,4 @@
 // Owner of the tests precompiled header (see test_pch.h).
-int main() { return 0; }
+int main() {
+  return 0;
+}
