@@ -5,6 +5,7 @@
 #include "drivers/upnp.h"
 
 #include "fake_igd.h"
+#include "upnp_driver_options.h"
 
 #include <gtest/gtest.h>
 
@@ -21,21 +22,9 @@ using test::SoapFault;
 using test::SoapRequest;
 using test::SoapResponse;
 
-const std::vector<Ipv4Network> kLoopback = {{0x7f000000u, 0xff000000u}};
-
-UpnpOptions OptionsFor(const FakeIgd &igd) {
-  UpnpOptions options;
-  options.gateway = "127.0.0.1";
-  options.knownRootDescUrls = {igd.RootDescUrl()};
-  options.discover = false;
-  options.localNetworks = kLoopback;
-  return options;
-}
-
-PortMapping Tcp(uint16_t external, uint16_t internal) {
-  return {IpProtocol::kTcp, external, internal, "127.0.0.1",
-          "zarkportforward test"};
-}
+using test::kLoopback;
+using test::OptionsFor;
+using test::Tcp;
 
 TEST(PortMapRouterUpnpScripted, TrickledReplyIsReadWhole) {
   FakeIgd igd;

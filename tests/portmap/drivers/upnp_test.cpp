@@ -5,6 +5,7 @@
 
 #include "fake_igd.h"
 #include "syslog_capture.h"
+#include "upnp_driver_options.h"
 
 #include <gtest/gtest.h>
 
@@ -23,21 +24,9 @@ using test::IgdVariant;
 using test::SoapFault;
 using test::SoapRequest;
 
-const std::vector<Ipv4Network> kLoopback = {{0x7f000000u, 0xff000000u}};
-
-UpnpOptions OptionsFor(const FakeIgd &igd) {
-  UpnpOptions options;
-  options.gateway = "127.0.0.1";
-  options.knownRootDescUrls = {igd.RootDescUrl()};
-  options.discover = false;
-  options.localNetworks = kLoopback;
-  return options;
-}
-
-PortMapping Tcp(uint16_t external, uint16_t internal) {
-  return {IpProtocol::kTcp, external, internal, "127.0.0.1",
-          "zarkportforward test"};
-}
+using test::kLoopback;
+using test::OptionsFor;
+using test::Tcp;
 
 int LogLinesContaining(const std::string &text) {
   std::vector<std::string> messages = test::CapturedMessages();
